@@ -1,0 +1,81 @@
+#include "HostCommand.h"
+
+#include <QJsonArray>
+#include <QJsonDocument>
+#include <QJsonObject>
+
+bool parseHostOptions(const QStringList& args, HostOptions* options, QString* error)
+{
+    for (int i = 0; i < args.size(); ++i) {
+        const QString& arg = args.at(i);
+        auto takeValue = [&](QString* out) {
+            if (i + 1 >= args.size()) {
+                *error = QStringLiteral("%1 needs a value").arg(arg);
+                return false;
+            }
+            *out = args.at(++i);
+            return true;
+        };
+        auto takeSeconds = [&](double* out) {
+            QString text;
+            if (!takeValue(&text)) {
+                return false;
+            }
+            bool ok = false;
+            const double seconds = text.toDouble(&ok);
+            if (!ok || seconds < 0) {
+                *error = QStringLiteral("%1 needs a number of seconds, not \"%2\"").arg(arg, text);
+                return false;
+            }
+            *out = seconds;
+            return true;
+        };
+        if (arg == QLatin1String("--data")) {
+            if (!takeValue(&options->dataDir)) {
+                return false;
+            }
+        } else if (arg == QLatin1String("--module")) {
+            if (!takeValue(&options->modulePath)) {
+                return false;
+            }
+        } else if (arg == QLatin1String("--wait")) {
+            if (!takeSeconds(&options->waitSeconds)) {
+                return false;
+            }
+        } else if (arg == QLatin1String("--timeout")) {
+            if (!takeSeconds(&options->timeoutSeconds)) {
+                return false;
+            }
+        } else if (arg.startsWith(QLatin1String("--")) && arg.size() > 2) {
+            *error = QStringLiteral("unknown option %1").arg(arg);
+            return false;
+        } else {
+            options->positional << arg;
+        }
+    }
+    return true;
+}
+
+QByteArray replyLine(bool bFinal, const QString& strCode, const QString& strMessage, const QVariant& payload)
+{
+    QJsonObject line;
+    line.insert(QStringLiteral("final"), bFinal);
+    line.insert(QStringLiteral("code"), strCode);
+    line.insert(QStringLiteral("message"), strMessage);
+    line.insert(QStringLiteral("payload"), payload.isValid() ? QJsonValue::fromVariant(payload) : QJsonValue());
+    return QJsonDocument(line).toJson(QJsonDocument::Compact);
+}
+
+bool parseJsonParameter(const QString& text, QVariant* value, QString* error)
+{
+    // Wrapped in an array so that bare values (numbers, texts) parse as well as objects.
+    QJsonParseError parseError{};
+    const QJsonDocument document =
+        QJsonDocument::fromJson(QByteArray("[") + text.toUtf8() + QByteArray("]"), &parseError);
+    if (parseError.error != QJsonParseError::NoError || !document.isArray() || document.array().size() != 1) {
+        *error = QStringLiteral("the parameter is not one JSON value: %1").arg(parseError.errorString());
+        return false;
+    }
+    *value = document.array().at(0).toVariant();
+    return true;
+}

@@ -1,0 +1,29 @@
+#pragma once
+// Shared pieces of the delvix-host subcommands: argument handling and reply printing.
+
+#include <QJsonValue>
+#include <QString>
+#include <QStringList>
+#include <QVariant>
+
+struct HostOptions
+{
+    QString dataDir = QStringLiteral("./delvix-data");
+    QString modulePath;  // empty: the module built beside this program
+    double waitSeconds = 2.0;
+    double timeoutSeconds = 120.0;
+    QStringList positional;
+};
+
+// Parses the options every subcommand shares (--data, --module, --wait, --timeout) and
+// collects the rest as positional arguments. Returns false with a message on a bad option.
+bool parseHostOptions(const QStringList& args, HostOptions* options, QString* error);
+
+// One reply as the JSON line {"final", "code", "message", "payload"}; an invalid payload is null.
+QByteArray replyLine(bool bFinal, const QString& strCode, const QString& strMessage, const QVariant& payload);
+
+// Parses a command's parameter text: any JSON value (an object, or a bare number such as 5).
+bool parseJsonParameter(const QString& text, QVariant* value, QString* error);
+
+int runCall(const HostOptions& options);
+int runDemo(const HostOptions& options);

@@ -58,12 +58,15 @@ bool parseHostOptions(const QStringList& args, HostOptions* options, QString* er
 
 QByteArray replyLine(bool bFinal, const QString& strCode, const QString& strMessage, const QVariant& payload)
 {
-    QJsonObject line;
-    line.insert(QStringLiteral("final"), bFinal);
-    line.insert(QStringLiteral("code"), strCode);
-    line.insert(QStringLiteral("message"), strMessage);
-    line.insert(QStringLiteral("payload"), payload.isValid() ? QJsonValue::fromVariant(payload) : QJsonValue());
-    return QJsonDocument(line).toJson(QJsonDocument::Compact);
+    // Written by hand to keep the keys in reading order (a QJsonObject would sort them).
+    auto json = [](const QJsonValue& value) {
+        return QJsonDocument(QJsonArray{value}).toJson(QJsonDocument::Compact).mid(1).chopped(1);
+    };
+    QByteArray line = "{\"final\":" + json(bFinal) + ",\"code\":" + json(strCode) + ",\"message\":" +
+                      json(strMessage) + ",\"payload\":";
+    line += payload.isValid() ? json(QJsonValue::fromVariant(payload)) : QByteArray("null");
+    line += '}';
+    return line;
 }
 
 bool parseJsonParameter(const QString& text, QVariant* value, QString* error)

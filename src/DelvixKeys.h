@@ -122,3 +122,16 @@ static const QString PLUGIN_ID_BOOKMARK = QStringLiteral("2F6394EE90434A7190D751
 
 // Installation directory of the object-metadata store (registry value).
 static const QString KEY_INSTALL_PATH = QStringLiteral("INSTALL_PATH");
+
+// Case vault schema. Existing vault files were made by exactly these statements; keep them as
+// they stand so that every file made before opens unchanged.
+static const QString SQL_CREATE_CASE_TABLE = QStringLiteral(
+    "CREATE TABLE IF NOT EXISTS \"Case\" (id INTEGER PRIMARY KEY AUTOINCREMENT,name TEXT,number TEXT,"
+    "reporter TEXT,description TEXT,createdTime INTEGER);");
+static const QString SQL_CREATE_CASE_ITEM_TABLE = QStringLiteral(
+    "CREATE TABLE IF NOT EXISTS CaseItem (id INTEGER PRIMARY KEY AUTOINCREMENT,caseId INTEGER,startTime "
+    "INTEGER,endTime INTEGER,itemType INT,nodeId TEXT,locationId TEXT,objectImage TEXT,trajectory "
+    "TEXT,faceImage TEXT,previewImage TEXT,showFacePhotoOnReport INTEGER DEFAULT(1),showObjectPhotoOnReport "
+    "INTEGER DEFAULT(1),comment TEXT DEFAULT(''),emapImageScale DOUBLE DEFAULT(-1),emapAngle DOUBLE "
+    "DEFAULT(0),bookmarkId INTEGER,needBookmark BOOLEAN,FOREIGN KEY(`caseId`) REFERENCES `Case`(`id`) ON "
+    "DELETE CASCADE);");

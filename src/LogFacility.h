@@ -34,9 +34,9 @@ public:
 
 // Writes one line: DELVIX_LOG(LogFacility::LevelError, "%s, GetPluginObject failure", "X::f").
 // The arguments are evaluated only when the library wants the line.
-#define DELVIX_LOG(level, ...)                                                                                  \
-    do {                                                                                                       \
-        if (LogFacility::allow((level), __FILE__, __LINE__)) {                                                 \
-            LogFacility::write(__VA_ARGS__);                                                                   \
-        }                                                                                                      \
+#define DELVIX_LOG(level, ...)                                                                               \
+    do {                                                                                                     \
+        if (LogFacility::allow((level), __FILE__, __LINE__)) {                                               \
+            LogFacility::write(__VA_ARGS__);                                                                 \
+        }                                                                                                    \
     } while (0)

@@ -45,7 +45,8 @@ void* PlatformHelper::loadLibrary(const char* windowsFileName)
         return nullptr;
     }
     const QDir moduleDir = QFileInfo(QString::fromLocal8Bit(info.dli_fname)).absoluteDir();
-    const QStringList candidates{moduleDir.filePath(name), moduleDir.filePath(QLatin1String("../lib/") + name)};
+    const QStringList candidates{moduleDir.filePath(name),
+                                 moduleDir.filePath(QLatin1String("../lib/") + name)};
     for (const QString& candidate : candidates) {
         if (QFileInfo::exists(candidate)) {
             if (void* handle = dlopen(candidate.toLocal8Bit().constData(), RTLD_NOW | RTLD_LOCAL)) {

@@ -82,7 +82,8 @@ void PluginDelvixSrv::Request(const QString& strCommand, const QVariant& params,
         DELVIX_LOG(LogFacility::LevelError, "%s, %s failed: %s", "PluginDelvixSrv::Request",
                    qPrintable(strCommand), e.what());
     } catch (...) {
-        DELVIX_LOG(LogFacility::LevelError, "%s, %s failed", "PluginDelvixSrv::Request", qPrintable(strCommand));
+        DELVIX_LOG(LogFacility::LevelError, "%s, %s failed", "PluginDelvixSrv::Request",
+                   qPrintable(strCommand));
     }
 }
 
@@ -102,7 +103,8 @@ void PluginDelvixSrv::UnsubscribeEventBlock(const QString&, const QVariant&, IRe
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::UnsubscribeEventBlock");
 }
 
-void PluginDelvixSrv::replyNotAvailable(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const
+void PluginDelvixSrv::replyNotAvailable(const char* strCommand,
+                                        const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const
 {
     DELVIX_LOG(LogFacility::LevelError, "%s, command %s is not available yet", "PluginDelvixSrv::Request",
                strCommand);

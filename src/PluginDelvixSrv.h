@@ -31,11 +31,13 @@ public:
                       IResponser& responser) override;
     void SubscribeEventBlock(const QString& strEvent, const QString& strFilter, const QVariant& params,
                              const RequestSenderInfo& senderInfo, IResponser& responser) override;
-    void UnsubscribeEventBlock(const QString& strEvent, const QVariant& params, IResponser& responser) override;
+    void UnsubscribeEventBlock(const QString& strEvent, const QVariant& params,
+                               IResponser& responser) override;
     void AllPluginLoaded() override;
 
     // One handler per command of the dispatch table.
-    using CommandHandler = void (PluginDelvixSrv::*)(const QVariant& params, const RequestSenderInfo& senderInfo,
+    using CommandHandler = void (PluginDelvixSrv::*)(const QVariant& params,
+                                                     const RequestSenderInfo& senderInfo,
                                                      const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
 
 private:

@@ -10,8 +10,8 @@
 
 // Reply callback handed with every request: (final flag, return code, message, payload).
 // Callable from any thread, and from several threads at once.
-using HDLR_DO_REQUEST_CB =
-    std::function<void(bool bFinal, const QString& strReturnCode, const QString& strMessage, const QVariant& payload)>;
+using HDLR_DO_REQUEST_CB = std::function<void(bool bFinal, const QString& strReturnCode,
+                                              const QString& strMessage, const QVariant& payload)>;
 
 // Answer of a relayed request: (flag, result, return code, message, flag). Called once.
 using HDLR_RELAY_RESPONSE_CB = std::function<void(bool bSuccess, QVariant result, QString strReturnCode,

@@ -19,6 +19,6 @@ public:
     QObject* GetPluginObject(const QString& strPluginId) override;
 
 private:
-    QMutex m_mutex;                             // guards m_objects
+    QMutex m_mutex;                              // guards m_objects
     QHash<QString, QPointer<QObject>> m_objects; // guarded by m_mutex
 };

@@ -16,8 +16,9 @@ void HostRelaySender::removeRemoteServer(const QString& strRelayPath)
     m_remoteServers.remove(strRelayPath);
 }
 
-bool HostRelaySender::RelayRequest(const QString& strPluginId, const QString& strCommand, const QVariant& params,
-                                   bool, const QString& strRelayPath, HDLR_RELAY_RESPONSE_CB hdlrResponse)
+bool HostRelaySender::RelayRequest(const QString& strPluginId, const QString& strCommand,
+                                   const QVariant& params, bool, const QString& strRelayPath,
+                                   HDLR_RELAY_RESPONSE_CB hdlrResponse)
 {
     IPluginManager* remote = nullptr;
     {

@@ -18,10 +18,10 @@ public:
     void addRemoteServer(const QString& strRelayPath, IPluginManager* remoteManager);
     void removeRemoteServer(const QString& strRelayPath);
 
-    bool RelayRequest(const QString& strPluginId, const QString& strCommand, const QVariant& params, bool bBlock,
-                      const QString& strRelayPath, HDLR_RELAY_RESPONSE_CB hdlrResponse) override;
+    bool RelayRequest(const QString& strPluginId, const QString& strCommand, const QVariant& params,
+                      bool bBlock, const QString& strRelayPath, HDLR_RELAY_RESPONSE_CB hdlrResponse) override;
 
 private:
-    QMutex m_mutex;                                // guards m_remoteServers
+    QMutex m_mutex;                                  // guards m_remoteServers
     QHash<QString, IPluginManager*> m_remoteServers; // guarded by m_mutex
 };

@@ -23,13 +23,15 @@ public:
 
     virtual bool InitialPluginBase(IFrameworkTools* pTools) = 0;
     // Asynchronous request: answered through hdlrDoRequestCB, now or later, from any thread.
-    virtual void Request(const QString& strCommand, const QVariant& params, const RequestSenderInfo& senderInfo,
-                         HDLR_DO_REQUEST_CB hdlrDoRequestCB) = 0;
+    virtual void Request(const QString& strCommand, const QVariant& params,
+                         const RequestSenderInfo& senderInfo, HDLR_DO_REQUEST_CB hdlrDoRequestCB) = 0;
     virtual void RequestBlock(const QString& strCommand, const QVariant& params,
                               const RequestSenderInfo& senderInfo, IResponser& responser) = 0;
-    virtual void SubscribeEventBlock(const QString& strEvent, const QString& strFilter, const QVariant& params,
-                                     const RequestSenderInfo& senderInfo, IResponser& responser) = 0;
-    virtual void UnsubscribeEventBlock(const QString& strEvent, const QVariant& params, IResponser& responser) = 0;
+    virtual void SubscribeEventBlock(const QString& strEvent, const QString& strFilter,
+                                     const QVariant& params, const RequestSenderInfo& senderInfo,
+                                     IResponser& responser) = 0;
+    virtual void UnsubscribeEventBlock(const QString& strEvent, const QVariant& params,
+                                       IResponser& responser) = 0;
 
     virtual void PluginLoaded() {}
     virtual void AllPluginLoaded() {}

@@ -12,7 +12,8 @@ class IRelaySender
 {
 public:
     virtual bool RelayRequest(const QString& strPluginId, const QString& strCommand, const QVariant& params,
-                              bool bBlock, const QString& strRelayPath, HDLR_RELAY_RESPONSE_CB hdlrResponse) = 0;
+                              bool bBlock, const QString& strRelayPath,
+                              HDLR_RELAY_RESPONSE_CB hdlrResponse) = 0;
 
 protected:
     ~IRelaySender() = default;

@@ -7,7 +7,8 @@
 class IResponser
 {
 public:
-    virtual void Respond(const QString& strReturnCode, const QString& strMessage, const QVariant& payload) = 0;
+    virtual void Respond(const QString& strReturnCode, const QString& strMessage,
+                         const QVariant& payload) = 0;
 
 protected:
     ~IResponser() = default;

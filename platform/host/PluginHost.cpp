@@ -17,7 +17,8 @@ PluginHost::PluginHost(const QString& strDataDir, QObject* parent)
     const QString databasePath = QDir(m_strDataDir).filePath(QStringLiteral("database"));
     QDir().mkpath(databasePath);
     m_serverInfo = std::make_unique<PluginServerInfo>(databasePath);
-    m_pluginManager.registerPluginObject(QString::fromLatin1(PluginServerInfo::pluginId()), m_serverInfo.get());
+    m_pluginManager.registerPluginObject(QString::fromLatin1(PluginServerInfo::pluginId()),
+                                         m_serverInfo.get());
     publishInstallPath(QDir(m_strDataDir).filePath(QStringLiteral("config")), m_strDataDir);
     // Several requests at once, as the management server delivers them.
     m_requestPool.setMaxThreadCount(4);
@@ -80,7 +81,8 @@ bool PluginHost::load(const QString& strModulePath, QString* error)
     QObject* instance = loader->instance();
     auto* plugin = qobject_cast<IPluginObjectBase*>(instance);
     if (!plugin) {
-        return fail(QStringLiteral("%1 could not be instantiated: %2").arg(strModulePath, loader->errorString()));
+        return fail(
+            QStringLiteral("%1 could not be instantiated: %2").arg(strModulePath, loader->errorString()));
     }
     m_loader = std::move(loader);
     m_plugin = plugin;
@@ -89,8 +91,8 @@ bool PluginHost::load(const QString& strModulePath, QString* error)
     return true;
 }
 
-void PluginHost::request(const QString& strCommand, const QVariant& params, const RequestSenderInfo& senderInfo,
-                         HDLR_DO_REQUEST_CB hdlrDoRequestCB)
+void PluginHost::request(const QString& strCommand, const QVariant& params,
+                         const RequestSenderInfo& senderInfo, HDLR_DO_REQUEST_CB hdlrDoRequestCB)
 {
     QPointer<IPluginObjectBase> plugin = m_plugin;
     m_requestPool.start([plugin, strCommand, params, senderInfo, hdlrDoRequestCB]() {

@@ -3,8 +3,7 @@
 PluginServerInfo::PluginServerInfo(const QString& strDatabasePath, QObject* parent)
     : QObject(parent)
     , m_strDatabasePath(strDatabasePath)
-{
-}
+{}
 
 QString PluginServerInfo::serverDatabasePath() const
 {

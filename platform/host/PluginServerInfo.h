@@ -22,6 +22,6 @@ signals:
     void serverDatabasePathChanged(const QString& path);
 
 private:
-    mutable QMutex m_mutex;  // guards m_strDatabasePath
+    mutable QMutex m_mutex; // guards m_strDatabasePath
     QString m_strDatabasePath;
 };

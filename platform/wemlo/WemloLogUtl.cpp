@@ -15,12 +15,18 @@ namespace {
 const char* levelName(int level)
 {
     switch (level) {
-    case 1: return "FATAL";
-    case 2: return "ERROR";
-    case 3: return "NOTE";
-    case 4: return "INFO";
-    case 5: return "TRACE";
-    default: return "LEVEL";
+    case 1:
+        return "FATAL";
+    case 2:
+        return "ERROR";
+    case 3:
+        return "NOTE";
+    case 4:
+        return "INFO";
+    case 5:
+        return "TRACE";
+    default:
+        return "LEVEL";
     }
 }
 
@@ -93,8 +99,9 @@ public:
 
         std::lock_guard<std::mutex> lock(m_mutex);
         const int module = pending.selector >> 8;
-        const char* moduleName =
-            module > 0 && static_cast<size_t>(module) <= m_modules.size() ? m_modules[module - 1].c_str() : "-";
+        const char* moduleName = module > 0 && static_cast<size_t>(module) <= m_modules.size()
+                                     ? m_modules[module - 1].c_str()
+                                     : "-";
         std::fprintf(m_file, "%s.%03d %s %s %s:%d %s\n", stamp, millis, levelName(pending.selector & 0xff),
                      moduleName, file, pending.line, text);
         std::fflush(m_file);

@@ -23,12 +23,12 @@ typedef void (*WemloWriteFn)(void* context, const char* format, va_list args);
 struct WemloLogObject
 {
     void* reserved0[3];
-    void* context;                        // word 3
+    void* context; // word 3
     void* reserved4[5];
     WemloRegisterModuleFn registerModule; // word 9
     void* reserved10[4];
-    WemloCheckFn check;                   // word 14
-    WemloWriteFn write;                   // word 15
+    WemloCheckFn check; // word 14
+    WemloWriteFn write; // word 15
 };
 
 static_assert(offsetof(WemloLogObject, context) == 3 * 8, "word 3");

@@ -15,7 +15,8 @@ int g_callClient = 0;
 int runCall(const HostOptions& options)
 {
     if (options.positional.isEmpty() || options.positional.size() > 2) {
-        std::fprintf(stderr, "usage: delvix-host call [--data DIR] [--wait S] [--timeout S] COMMAND [JSON]\n");
+        std::fprintf(stderr,
+                     "usage: delvix-host call [--data DIR] [--wait S] [--timeout S] COMMAND [JSON]\n");
         return 2;
     }
     const QString command = options.positional.at(0);
@@ -30,7 +31,8 @@ int runCall(const HostOptions& options)
 
     PluginHost host(options.dataDir);
     QString error;
-    const QString module = options.modulePath.isEmpty() ? PluginHost::defaultModulePath() : options.modulePath;
+    const QString module =
+        options.modulePath.isEmpty() ? PluginHost::defaultModulePath() : options.modulePath;
     if (!host.load(module, &error)) {
         std::fprintf(stderr, "delvix-host: %s\n", qUtf8Printable(error));
         return 1;

@@ -18,8 +18,8 @@ void showCall(PluginHost& host, const char* explanation, const QString& command,
                 params.isValid() ? replyLine(false, QString(), QString(), params).constData() : "");
     QEventLoop loop;
     QObject context;
-    HDLR_DO_REQUEST_CB reply = [&context, &loop](bool bFinal, const QString& strCode, const QString& strMessage,
-                                                 const QVariant& payload) {
+    HDLR_DO_REQUEST_CB reply = [&context, &loop](bool bFinal, const QString& strCode,
+                                                 const QString& strMessage, const QVariant& payload) {
         const QByteArray line = replyLine(bFinal, strCode, strMessage, payload);
         QMetaObject::invokeMethod(
             &context,
@@ -47,14 +47,16 @@ int runDemo(const HostOptions& options)
     timer.start();
     PluginHost host(options.dataDir);
     QString error;
-    const QString module = options.modulePath.isEmpty() ? PluginHost::defaultModulePath() : options.modulePath;
+    const QString module =
+        options.modulePath.isEmpty() ? PluginHost::defaultModulePath() : options.modulePath;
     if (!host.load(module, &error)) {
         std::fprintf(stderr, "delvix-host: %s\n", qUtf8Printable(error));
         return 1;
     }
     std::printf("Loaded %s\nData folder: %s\n", qUtf8Printable(module), qUtf8Printable(host.dataDir()));
 
-    showCall(host, "A command the plug-in does not know is refused", QStringLiteral("noSuchCommand"), QVariant());
+    showCall(host, "A command the plug-in does not know is refused", QStringLiteral("noSuchCommand"),
+             QVariant());
     showCall(host, "Command names are case-sensitive", QStringLiteral("StartSearch"), QVariant());
     showCall(host, "The case list", QStringLiteral("getCaseList"), QVariant());
 

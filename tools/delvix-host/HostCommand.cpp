@@ -62,8 +62,8 @@ QByteArray replyLine(bool bFinal, const QString& strCode, const QString& strMess
     auto json = [](const QJsonValue& value) {
         return QJsonDocument(QJsonArray{value}).toJson(QJsonDocument::Compact).mid(1).chopped(1);
     };
-    QByteArray line = "{\"final\":" + json(bFinal) + ",\"code\":" + json(strCode) + ",\"message\":" +
-                      json(strMessage) + ",\"payload\":";
+    QByteArray line = "{\"final\":" + json(bFinal) + ",\"code\":" + json(strCode) +
+                      ",\"message\":" + json(strMessage) + ",\"payload\":";
     line += payload.isValid() ? json(QJsonValue::fromVariant(payload)) : QByteArray("null");
     line += '}';
     return line;

@@ -9,7 +9,7 @@
 struct HostOptions
 {
     QString dataDir = QStringLiteral("./delvix-data");
-    QString modulePath;  // empty: the module built beside this program
+    QString modulePath; // empty: the module built beside this program
     double waitSeconds = 2.0;
     double timeoutSeconds = 120.0;
     QStringList positional;

@@ -10,12 +10,13 @@ namespace {
 
 void printUsage(std::FILE* out)
 {
-    std::fprintf(out, "usage: delvix-host SUBCOMMAND [--data DIR] [--module PATH] ...\n"
-                      "  call COMMAND [JSON]   send one request, print each reply as a JSON line\n"
-                      "                        [--wait S] end after S s when no reply came (default 2)\n"
-                      "                        [--timeout S] give up waiting for the final reply (default 120)\n"
-                      "  demo                  load the plug-in and show what it does\n"
-                      "  --data DIR            the host's data folder (default ./delvix-data)\n");
+    std::fprintf(out,
+                 "usage: delvix-host SUBCOMMAND [--data DIR] [--module PATH] ...\n"
+                 "  call COMMAND [JSON]   send one request, print each reply as a JSON line\n"
+                 "                        [--wait S] end after S s when no reply came (default 2)\n"
+                 "                        [--timeout S] give up waiting for the final reply (default 120)\n"
+                 "  demo                  load the plug-in and show what it does\n"
+                 "  --data DIR            the host's data folder (default ./delvix-data)\n");
 }
 
 } // namespace

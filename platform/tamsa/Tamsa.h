@@ -1,6 +1,6 @@
 #pragma once
 // Tamsa: the object-metadata store. C entry points and the records that cross them
-// (layouts byte-exact with the specification, Part 2.1; 64-bit, natural alignment).
+// (byte-exact layouts shared with the plug-in; 64-bit, natural alignment).
 //
 // Statuses: every entry point returns a 32-bit signed status, 0 = success. TAMSA_E_NO_MORE_RECORDS
 // (0x80431905) is not a failure: Next returns it once the enumeration is exhausted (and again on
@@ -40,70 +40,70 @@ extern "C" {
 
 // ---- statuses ------------------------------------------------------------------------------
 #define TAMSA_OK 0
-#define TAMSA_E_INVALID_ARGUMENT ((int32_t)0x80431901)  // null handle or pointer, wrong wSize
-#define TAMSA_E_NO_STORAGE_PATH ((int32_t)0x80431902)   // no (usable) Tamsa_SetStoragesDBPath yet
-#define TAMSA_E_IO ((int32_t)0x80431903)                // a file or SQLite operation failed
-#define TAMSA_E_ABORTED ((int32_t)0x80431904)           // the search was ended by Abort
-#define TAMSA_E_NO_MORE_RECORDS ((int32_t)0x80431905)   // end of records (not a failure)
-#define TAMSA_E_BAD_JSON ((int32_t)0x80431906)          // ingest text is not the camera answer format
-#define TAMSA_E_BAD_QUERY ((int32_t)0x80431907)         // a query text is malformed (attributes, trace, feature)
-#define TAMSA_E_OUT_OF_MEMORY ((int32_t)0x80431908)     // an allocation failed
-#define TAMSA_E_BUSY ((int32_t)0x80431909)              // the storage stayed locked by another writer
+#define TAMSA_E_INVALID_ARGUMENT ((int32_t)0x80431901) // null handle or pointer, wrong wSize
+#define TAMSA_E_NO_STORAGE_PATH ((int32_t)0x80431902)  // no (usable) Tamsa_SetStoragesDBPath yet
+#define TAMSA_E_IO ((int32_t)0x80431903)               // a file or SQLite operation failed
+#define TAMSA_E_ABORTED ((int32_t)0x80431904)          // the search was ended by Abort
+#define TAMSA_E_NO_MORE_RECORDS ((int32_t)0x80431905)  // end of records (not a failure)
+#define TAMSA_E_BAD_JSON ((int32_t)0x80431906)         // ingest text is not the camera answer format
+#define TAMSA_E_BAD_QUERY ((int32_t)0x80431907)     // a query text is malformed (attributes, trace, feature)
+#define TAMSA_E_OUT_OF_MEMORY ((int32_t)0x80431908) // an allocation failed
+#define TAMSA_E_BUSY ((int32_t)0x80431909)          // the storage stayed locked by another writer
 
 // ---- records -------------------------------------------------------------------------------
 // Every record starts with a 16-bit size the caller fills in; reserved bytes are zero.
 
 typedef struct TTAMSA_TZDS
 {
-    uint16_t wZone;        // 0: time zone in quarter hours, biased by 48
-    uint16_t wDaylight;    // 2: 1 when daylight saving is in force
-    uint8_t reserved[12];  // 4
+    uint16_t wZone;       // 0: time zone in quarter hours, biased by 48
+    uint16_t wDaylight;   // 2: 1 when daylight saving is in force
+    uint8_t reserved[12]; // 4
 } TTAMSA_TZDS;
 
 typedef struct TTAMSA_OBJECTMETAINFO_QUERY
 {
-    uint16_t wSize;                    // 0: 128
-    uint16_t reserved2;                // 2
-    uint32_t dwStartTime;              // 4: window start, seconds since the Unix epoch
-    uint32_t reserved8;                // 8
-    uint32_t dwEndTime;                // 12: window end, seconds since the Unix epoch
-    uint32_t reserved16;               // 16
-    TTAMSA_TZDS tzds;                  // 20: the server's zone (informational)
-    uint32_t reserved36;               // 36
-    const uint32_t* pdwLocationIds;    // 40: location numbers ended by 0; null or empty matches nothing
-    const char* pszObjectType;         // 48: "Human", "Vehicle" or null (any)
-    const char* pszPrimaryAttributes;  // 56: compact JSON object, or null
-    const char* pszTrace;              // 64: JSON array of [x, y] points, or null
-    uint32_t dwDuration;               // 72: loitering duration, seconds
-    uint32_t bLoitering;               // 76: 1 or 0
-    uint32_t bDescending;              // 80: 1 or 0
-    int32_t nDirection;                // 84: 0 either way, 1 negative->positive, 2 positive->negative
-    const char* pszOtherAttributes;    // 88: compact JSON object, or null
-    uint32_t bDoNotSort;               // 96: 1 or 0
-    uint32_t reserved100;              // 100
-    const char* pszFeature;            // 104: compact JSON array of numbers (body vector), or null
-    const char* pszFaceFeature;        // 112: compact JSON array of numbers (face vector), or null
-    const char* pszPlateNumber;        // 120: plate text with * and ? wildcards, or null
+    uint16_t wSize;                   // 0: 128
+    uint16_t reserved2;               // 2
+    uint32_t dwStartTime;             // 4: window start, seconds since the Unix epoch
+    uint32_t reserved8;               // 8
+    uint32_t dwEndTime;               // 12: window end, seconds since the Unix epoch
+    uint32_t reserved16;              // 16
+    TTAMSA_TZDS tzds;                 // 20: the server's zone (informational)
+    uint32_t reserved36;              // 36
+    const uint32_t* pdwLocationIds;   // 40: location numbers ended by 0; null or empty matches nothing
+    const char* pszObjectType;        // 48: "Human", "Vehicle" or null (any)
+    const char* pszPrimaryAttributes; // 56: compact JSON object, or null
+    const char* pszTrace;             // 64: JSON array of [x, y] points, or null
+    uint32_t dwDuration;              // 72: loitering duration, seconds
+    uint32_t bLoitering;              // 76: 1 or 0
+    uint32_t bDescending;             // 80: 1 or 0
+    int32_t nDirection;               // 84: 0 either way, 1 negative->positive, 2 positive->negative
+    const char* pszOtherAttributes;   // 88: compact JSON object, or null
+    uint32_t bDoNotSort;              // 96: 1 or 0
+    uint32_t reserved100;             // 100
+    const char* pszFeature;           // 104: compact JSON array of numbers (body vector), or null
+    const char* pszFaceFeature;       // 112: compact JSON array of numbers (face vector), or null
+    const char* pszPlateNumber;       // 120: plate text with * and ? wildcards, or null
 } TTAMSA_OBJECTMETAINFO_QUERY;
 
 typedef struct TTAMSA_OBJECTMETAINFO_RESULT
 {
-    uint16_t wSize;               // 0: 80, set by the caller
-    uint16_t reserved2;           // 2
-    uint32_t reserved4;           // 4
-    uint64_t qwObjectId;          // 8: the camera's "ID"
-    uint32_t dwLocationNumber;    // 16: location number ("Loc" + this number is the location id)
-    uint32_t reserved20;          // 20
-    const char* pszObjectType;    // 24: "Human", "Vehicle", ...
-    const char* pszAttributes;    // 32: JSON object of the object's attributes, as ingested
-    uint32_t dwStartTime;         // 40: first seen, seconds since the Unix epoch
-    uint32_t dwEndTime;           // 44: last seen, seconds since the Unix epoch
-    const double* pTrajectory;    // 48: points, each x then y (64-bit floats)
-    uint32_t dwTrajectoryBytes;   // 56: byte size of pTrajectory (16 per point)
-    uint32_t reserved60;          // 60
-    const char* pszThumbnails;    // 64: JSON object {"Thumbnail", "FaceThumbnail"?, "LicensePlateThumbnail"?}
-    float fScore;                 // 72: body cosine similarity, 0 when the query has no body vector
-    float fFaceScore;             // 76: face cosine similarity, 0 when the query has no face vector
+    uint16_t wSize;             // 0: 80, set by the caller
+    uint16_t reserved2;         // 2
+    uint32_t reserved4;         // 4
+    uint64_t qwObjectId;        // 8: the camera's "ID"
+    uint32_t dwLocationNumber;  // 16: location number ("Loc" + this number is the location id)
+    uint32_t reserved20;        // 20
+    const char* pszObjectType;  // 24: "Human", "Vehicle", ...
+    const char* pszAttributes;  // 32: JSON object of the object's attributes, as ingested
+    uint32_t dwStartTime;       // 40: first seen, seconds since the Unix epoch
+    uint32_t dwEndTime;         // 44: last seen, seconds since the Unix epoch
+    const double* pTrajectory;  // 48: points, each x then y (64-bit floats)
+    uint32_t dwTrajectoryBytes; // 56: byte size of pTrajectory (16 per point)
+    uint32_t reserved60;        // 60
+    const char* pszThumbnails;  // 64: JSON object {"Thumbnail", "FaceThumbnail"?, "LicensePlateThumbnail"?}
+    float fScore;               // 72: body cosine similarity, 0 when the query has no body vector
+    float fFaceScore;           // 76: face cosine similarity, 0 when the query has no face vector
 } TTAMSA_OBJECTMETAINFO_RESULT;
 
 // ---- entry points --------------------------------------------------------------------------
@@ -125,7 +125,7 @@ TAMSA_EXPORT void Tamsa_GetObjectMetaInfoClose(void* search);
 // Asks a search to end (thread-safe, see above). Null is a no-op.
 TAMSA_EXPORT void Tamsa_GetObjectMetaInfoAbort(void* search);
 // Our own ingest entry point: stores the objects of one camera answer
-// ({"ObjectMetaInfo": [object, ...]}, see shared/design.md) under locationNumber (> 0).
+// ({"ObjectMetaInfo": [object, ...]}, the format the cameras answer in) under locationNumber (> 0).
 // Returns the number of objects stored; elements that are not valid objects are skipped.
 // Returns a negative TAMSA_E_* code, and stores nothing, when the text is not that format.
 // An object with the (location, "ID") of a stored one replaces it.
@@ -134,7 +134,7 @@ TAMSA_EXPORT int32_t Tamsa_PutObjectMetaInfo(void* database, int32_t groupId, in
 
 } // extern "C"
 
-// ---- layout checks (Part 2.1) --------------------------------------------------------------
+// ---- layout checks ------------------------------------------------------------------------
 static_assert(sizeof(TTAMSA_TZDS) == 16, "TTAMSA_TZDS is 16 bytes");
 static_assert(offsetof(TTAMSA_TZDS, wZone) == 0, "wZone");
 static_assert(offsetof(TTAMSA_TZDS, wDaylight) == 2, "wDaylight");

@@ -135,3 +135,28 @@ static const QString SQL_CREATE_CASE_ITEM_TABLE = QStringLiteral(
     "INTEGER DEFAULT(1),comment TEXT DEFAULT(''),emapImageScale DOUBLE DEFAULT(-1),emapAngle DOUBLE "
     "DEFAULT(0),bookmarkId INTEGER,needBookmark BOOLEAN,FOREIGN KEY(`caseId`) REFERENCES `Case`(`id`) ON "
     "DELETE CASCADE);");
+
+// Trajectory points of a search record.
+static const QString KEY_X = QStringLiteral("x");
+static const QString KEY_Y = QStringLiteral("y");
+
+// Member names of the object-metadata store's thumbnail and attribute texts.
+static const QString TAMSA_THUMBNAIL = QStringLiteral("Thumbnail");
+static const QString TAMSA_FACE_THUMBNAIL = QStringLiteral("FaceThumbnail");
+static const QString TAMSA_LICENSE_PLATE_THUMBNAIL = QStringLiteral("LicensePlateThumbnail");
+static const QString TAMSA_IMAGE = QStringLiteral("image");
+static const QString TAMSA_FEATURE = QStringLiteral("feature");
+static const QString TAMSA_PLATE_NUMBER = QStringLiteral("PlateNumber");
+static const QString TAMSA_FACE_DETECTION_INFO = QStringLiteral("face_detection_info");
+static const QString TAMSA_DETECTION_INFO = QStringLiteral("detection_info");
+static const QString TAMSA_FILTERED = QStringLiteral("filtered");
+static const QString TAMSA_ATTR_AGE = QStringLiteral("Age");
+static const QString TAMSA_ATTR_GENDER = QStringLiteral("Gender");
+static const QString TAMSA_ATTR_ACCESSORIES = QStringLiteral("Accessories");
+static const QString TAMSA_ATTR_UPPER_COLOR = QStringLiteral("UpperColor");
+static const QString TAMSA_ATTR_LOWER_COLOR = QStringLiteral("LowerColor");
+static const QString TAMSA_ATTR_COLOR = QStringLiteral("Color");
+static const QString TAMSA_ATTR_TYPE = QStringLiteral("Type");
+static const QString TAMSA_OBJECT_TYPE_HUMAN = QStringLiteral("Human");
+static const QString TAMSA_OBJECT_TYPE_VEHICLE = QStringLiteral("Vehicle");
+static const QString LOCATION_PREFIX = QStringLiteral("Loc");

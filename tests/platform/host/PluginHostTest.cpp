@@ -50,6 +50,16 @@ ProcessResult runHost(const QStringList& args)
             process.readAllStandardOutput(), process.readAllStandardError()};
 }
 
+// Receives the server-information plug-in's path signal through the plug-in manager.
+class PathReceiver : public QObject
+{
+    Q_OBJECT
+public:
+    QStringList paths;
+public slots:
+    void onServerDatabasePathChanged(const QString& path) { paths << path; }
+};
+
 } // namespace
 
 TEST(PluginModule, LoadsFromBuildTreeWithItsMetadataAndOneInstance)
@@ -160,3 +170,34 @@ TEST(DelvixHostProgram, CallPrintsOneReplyLinePerReplyAndReportsUsageErrors)
     result = runHost({QStringLiteral("call"), QStringLiteral("--bogus"), QStringLiteral("x")});
     EXPECT_NE(result.exitCode, 0);
 }
+
+TEST(PluginHost, PluginManagerConnectsPluginSignalsAndRelayRefusesUnknownPaths)
+{
+    QTemporaryDir data;
+    PluginHost host(data.path());
+    PathReceiver receiver;
+    IPluginManager* manager = host.GetPluginManager();
+    ASSERT_NE(manager->GetPluginObject(QStringLiteral("3CE573D25E0F455B8F75EDDC573E2B64")), nullptr);
+    EXPECT_EQ(manager->GetPluginObject(QStringLiteral("no-such-plugin")), nullptr);
+    EXPECT_TRUE(manager->ConnectPluginSignal(QStringLiteral("3CE573D25E0F455B8F75EDDC573E2B64"),
+                                             "2serverDatabasePathChanged(const QString &)", &receiver,
+                                             "1onServerDatabasePathChanged(const QString &)", 0));
+    EXPECT_FALSE(manager->ConnectPluginSignal(QStringLiteral("no-such-plugin"),
+                                              "2serverDatabasePathChanged(const QString &)", &receiver,
+                                              "1onServerDatabasePathChanged(const QString &)", 0));
+    EXPECT_FALSE(manager->ConnectPluginSignal(QStringLiteral("3CE573D25E0F455B8F75EDDC573E2B64"),
+                                              "2noSuchSignal()", &receiver,
+                                              "1onServerDatabasePathChanged(const QString &)", 0));
+    host.serverInfo().setServerDatabasePath(QStringLiteral("/elsewhere"));
+    host.serverInfo().setServerDatabasePath(QStringLiteral("/elsewhere")); // unchanged: no signal
+    EXPECT_EQ(receiver.paths, QStringList{QStringLiteral("/elsewhere")});
+
+    bool answered = false;
+    EXPECT_FALSE(host.GetRelaySender()->RelayRequest(
+        QStringLiteral("2F6394EE90434A7190D7511370AFAE17"), QStringLiteral("AddBookmark"), QVariant(), false,
+        QStringLiteral("unknown-server"),
+        [&answered](bool, QVariant, QString, QString, bool) { answered = true; }));
+    EXPECT_FALSE(answered);
+}
+
+#include "PluginHostTest.moc"

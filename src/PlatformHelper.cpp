@@ -1,9 +1,15 @@
 #include "PlatformHelper.h"
 
 #include <QDir>
+#include <QFile>
 #include <QFileInfo>
+#include <QSet>
 #include <QSettings>
 #include <QStringList>
+#include <QThread>
+
+#include <ctime>
+#include <vector>
 
 #if defined(Q_OS_WIN)
 #include <windows.h>
@@ -109,4 +115,115 @@ QVariant PlatformHelper::readMachineSetting(const QString& strKeyPath, const QSt
 QChar PlatformHelper::nativeSeparator()
 {
     return QDir::separator();
+}
+
+PlatformHelper::LocalZone PlatformHelper::localZone()
+{
+    LocalZone zone;
+#if defined(Q_OS_WIN)
+    // What production reports: the registry's standard bias, and the C runtime's daylight
+    // flag for the present moment.
+    TIME_ZONE_INFORMATION information{};
+    if (GetTimeZoneInformation(&information) != TIME_ZONE_ID_INVALID) {
+        zone.standardBiasMinutes = static_cast<int>(information.Bias + information.StandardBias);
+    }
+    const __time64_t now = _time64(nullptr);
+    std::tm local = {};
+    if (_localtime64_s(&local, &now) == 0) {
+        zone.daylightNow = local.tm_isdst > 0;
+    }
+#else
+    // POSIX has no "standard bias" call: take the offset of a moment of this year that is not
+    // in daylight saving time (January or July, whichever hemisphere). localtime_r, unlike
+    // localtime, is safe from the re-identification threads that ask at the same time; tzset
+    // makes a changed TZ count, as a changed Windows zone does.
+    tzset();
+    const time_t now = std::time(nullptr);
+    std::tm local = {};
+    if (!localtime_r(&now, &local)) {
+        return zone;
+    }
+    zone.daylightNow = local.tm_isdst > 0;
+    long standardOffsetSeconds = local.tm_gmtoff;
+    if (zone.daylightNow) {
+        for (int month : {0, 6}) {
+            std::tm probe = {};
+            probe.tm_year = local.tm_year;
+            probe.tm_mon = month;
+            probe.tm_mday = 1;
+            probe.tm_hour = 12;
+            probe.tm_isdst = -1;
+            const time_t probeTime = mktime(&probe);
+            std::tm probeLocal = {};
+            if (probeTime != static_cast<time_t>(-1) && localtime_r(&probeTime, &probeLocal) &&
+                probeLocal.tm_isdst == 0) {
+                standardOffsetSeconds = probeLocal.tm_gmtoff;
+                break;
+            }
+        }
+    }
+    zone.standardBiasMinutes = static_cast<int>(-standardOffsetSeconds / 60);
+#endif
+    return zone;
+}
+
+int PlatformHelper::physicalCoreCount()
+{
+#if defined(Q_OS_WIN)
+    // One RelationProcessorCore entry per physical core, as production counts them.
+    DWORD bytes = 0;
+    GetLogicalProcessorInformation(nullptr, &bytes);
+    if (bytes == 0) {
+        return 0;
+    }
+    std::vector<SYSTEM_LOGICAL_PROCESSOR_INFORMATION> entries(bytes /
+                                                              sizeof(SYSTEM_LOGICAL_PROCESSOR_INFORMATION));
+    if (!GetLogicalProcessorInformation(entries.data(), &bytes)) {
+        return 0;
+    }
+    int cores = 0;
+    for (const SYSTEM_LOGICAL_PROCESSOR_INFORMATION& entry : entries) {
+        if (entry.Relationship == RelationProcessorCore) {
+            ++cores;
+        }
+    }
+    return cores;
+#else
+    // Linux names each logical CPU's package and core; distinct pairs are physical cores.
+    QSet<QString> cores;
+    const QDir cpuDir(QStringLiteral("/sys/devices/system/cpu"));
+    const QStringList cpus = cpuDir.entryList({QStringLiteral("cpu[0-9]*")}, QDir::Dirs);
+    for (const QString& cpu : cpus) {
+        QFile package(cpuDir.filePath(cpu + QStringLiteral("/topology/physical_package_id")));
+        QFile core(cpuDir.filePath(cpu + QStringLiteral("/topology/core_id")));
+        if (package.open(QIODevice::ReadOnly) && core.open(QIODevice::ReadOnly)) {
+            cores.insert(QString::fromLatin1(package.readAll().trimmed() + '/' + core.readAll().trimmed()));
+        }
+    }
+    if (cores.isEmpty()) {
+        // No sysfs (containers sometimes hide it): the same pairs from /proc/cpuinfo.
+        QFile cpuinfo(QStringLiteral("/proc/cpuinfo"));
+        if (cpuinfo.open(QIODevice::ReadOnly | QIODevice::Text)) {
+            QByteArray package;
+            const QList<QByteArray> lines = cpuinfo.readAll().split('\n');
+            for (const QByteArray& line : lines) {
+                const int colon = line.indexOf(':');
+                if (colon < 0) {
+                    continue;
+                }
+                const QByteArray key = line.left(colon).trimmed();
+                const QByteArray value = line.mid(colon + 1).trimmed();
+                if (key == "physical id") {
+                    package = value;
+                } else if (key == "core id") {
+                    cores.insert(QString::fromLatin1(package + '/' + value));
+                }
+            }
+        }
+    }
+    if (!cores.isEmpty()) {
+        return static_cast<int>(cores.size());
+    }
+    return qMax(0, QThread::idealThreadCount());
+#endif
 }

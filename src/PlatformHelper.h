@@ -27,4 +27,19 @@ public:
 
     // Native directory separator of this platform ('\\' on Windows).
     static QChar nativeSeparator();
+
+    // The local time zone as the store expects it: the standard bias in minutes (UTC minus
+    // local standard time, so UTC+8 gives -480) and whether daylight saving is in force now.
+    // Read anew on every call, so a zone change reaches the next query. Thread-safe.
+    struct LocalZone
+    {
+        int standardBiasMinutes = 0;
+        bool daylightNow = false;
+    };
+    static LocalZone localZone();
+
+    // Number of physical processor cores (hyper-threads of one core count once). When the
+    // platform does not say, the number of threads the machine runs at once; 0 only when even
+    // that is unknown.
+    static int physicalCoreCount();
 };

@@ -25,11 +25,29 @@ PluginDelvixSrv::PluginDelvixSrv()
 PluginDelvixSrv::~PluginDelvixSrv()
 {
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::~PluginDelvixSrv");
+    // The retriever goes before the collector: its running search still looks up cameras
+    // through the relay until the retriever has stopped it and waited for its thread.
+    m_pAttributeRetriever.reset();
+    m_pCameraInformationCollector.reset();
+}
+
+void PluginDelvixSrv::setAttributeRetriever(QSharedPointer<AttributeRetriever> pAttributeRetriever)
+{
+    m_pAttributeRetriever = std::move(pAttributeRetriever);
+}
+
+void PluginDelvixSrv::setCameraInformationCollector(
+    QSharedPointer<ICameraInformationCollector> pCameraInformationCollector)
+{
+    m_pCameraInformationCollector = std::move(pCameraInformationCollector);
 }
 
 bool PluginDelvixSrv::InitialPluginBase(IFrameworkTools* pTools)
 {
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::InitialPluginBase");
+    if (!m_pAttributeRetriever) {
+        m_pAttributeRetriever = QSharedPointer<AttributeRetriever>::create();
+    }
     if (pTools) {
         m_pPluginManager = pTools->GetPluginManager();
         m_pRelaySender = pTools->GetRelaySender();
@@ -113,28 +131,75 @@ void PluginDelvixSrv::replyNotAvailable(const char* strCommand,
     }
 }
 
-void PluginDelvixSrv::commandStartSearch(const QVariant&, const RequestSenderInfo&,
+AttributeRetriever::Callback PluginDelvixSrv::makeResultRelay(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+{
+    return [this, hdlrDoRequestCB](bool bFinished, const QVariantMap& record) {
+        if (!hdlrDoRequestCB) {
+            return;
+        }
+        // The host's callback must not unwind into the scheduler.
+        try {
+            if (bFinished) {
+                hdlrDoRequestCB(true, RC_SUCCESS, QString(), QVariant());
+                return;
+            }
+            QVariantMap hit = record;
+            hit.insert(KEY_NODE_ID, cameraNodeID(hit.value(KEY_LOC_ID).toString()));
+            hdlrDoRequestCB(false, RC_SUCCESS, QString(), hit);
+        } catch (const std::exception& e) {
+            DELVIX_LOG(LogFacility::LevelError, "%s, reply failed: %s", "PluginDelvixSrv::resultRelay",
+                       e.what());
+        } catch (...) {
+            DELVIX_LOG(LogFacility::LevelError, "%s, reply failed", "PluginDelvixSrv::resultRelay");
+        }
+    };
+}
+
+QString PluginDelvixSrv::cameraNodeID(const QString& locationId) const
+{
+    // No camera directory yet: hits carry an empty camera.
+    return m_pCameraInformationCollector ? m_pCameraInformationCollector->getCameraNodeID(locationId)
+                                         : QString();
+}
+
+void PluginDelvixSrv::commandStartSearch(const QVariant& params, const RequestSenderInfo& senderInfo,
                                          const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("startSearch", hdlrDoRequestCB);
+    if (!m_bEnableDelvix.load() || !m_pAttributeRetriever) {
+        if (hdlrDoRequestCB) {
+            hdlrDoRequestCB(true, RC_SUCCESS, QString(), QVariant());
+        }
+        return;
+    }
+    m_pAttributeRetriever->query(senderInfo.senderHandle, params.toMap(), makeResultRelay(hdlrDoRequestCB));
 }
 
-void PluginDelvixSrv::commandStopSearch(const QVariant&, const RequestSenderInfo&,
-                                        const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+void PluginDelvixSrv::commandStopSearch(const QVariant&, const RequestSenderInfo& senderInfo,
+                                        const HDLR_DO_REQUEST_CB&)
 {
-    replyNotAvailable("stopSearch", hdlrDoRequestCB);
+    if (m_pAttributeRetriever) {
+        m_pAttributeRetriever->stop(senderInfo.senderHandle);
+    }
 }
 
-void PluginDelvixSrv::commandStartReIdSearch(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandStartReIdSearch(const QVariant& params, const RequestSenderInfo& senderInfo,
                                              const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("startReIdSearch", hdlrDoRequestCB);
+    if (!m_bEnableDelvix.load() || !m_pAttributeRetriever) {
+        if (hdlrDoRequestCB) {
+            hdlrDoRequestCB(true, RC_SUCCESS, QString(), QVariant());
+        }
+        return;
+    }
+    m_pAttributeRetriever->reId(senderInfo.senderHandle, params.toMap(), makeResultRelay(hdlrDoRequestCB));
 }
 
-void PluginDelvixSrv::commandStopReIdSearch(const QVariant&, const RequestSenderInfo&,
-                                            const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+void PluginDelvixSrv::commandStopReIdSearch(const QVariant&, const RequestSenderInfo& senderInfo,
+                                            const HDLR_DO_REQUEST_CB&)
 {
-    replyNotAvailable("stopReIdSearch", hdlrDoRequestCB);
+    if (m_pAttributeRetriever) {
+        m_pAttributeRetriever->stop(senderInfo.senderHandle);
+    }
 }
 
 void PluginDelvixSrv::commandRetrieveDelvixData(const QVariant&, const RequestSenderInfo&,

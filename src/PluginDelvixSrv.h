@@ -3,13 +3,16 @@
 // dispatches by command name to one handler per command; the handlers answer through the
 // reply callback of the request, now or later and from any thread.
 
+#include "AttributeRetriever.h"
 #include "HostCallbacks.h"
+#include "ICameraInformationCollector.h"
 #include "IFrameworkTools.h"
 #include "IPluginManager.h"
 #include "IPluginObjectBase.h"
 #include "IRelaySender.h"
 
 #include <QObject>
+#include <QSharedPointer>
 #include <QString>
 #include <QVariant>
 #include <atomic>
@@ -34,6 +37,12 @@ public:
     void UnsubscribeEventBlock(const QString& strEvent, const QVariant& params,
                                IResponser& responser) override;
     void AllPluginLoaded() override;
+
+    // Components installed before InitialPluginBase stay; it creates only the missing ones.
+    // Install them before requests arrive: request and search threads read them unguarded.
+    void setAttributeRetriever(QSharedPointer<AttributeRetriever> pAttributeRetriever);
+    void
+    setCameraInformationCollector(QSharedPointer<ICameraInformationCollector> pCameraInformationCollector);
 
     // One handler per command of the dispatch table.
     using CommandHandler = void (PluginDelvixSrv::*)(const QVariant& params,
@@ -71,9 +80,17 @@ private:
     void commandRetrieveCaseItemModel(const QVariant& params, const RequestSenderInfo& senderInfo,
                                       const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
 
+    // Turns a search's (finished, record) stream into replies: one non-final reply per hit,
+    // with the camera of its location under "nodeID", then the final reply. Called from the
+    // scheduler thread, or from several re-identification threads at once.
+    AttributeRetriever::Callback makeResultRelay(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
+    QString cameraNodeID(const QString& locationId) const;
+
     // Answer of a command whose handler is not built yet: (true, "-1", "", none), logged.
     void replyNotAvailable(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
 
+    QSharedPointer<AttributeRetriever> m_pAttributeRetriever;
+    QSharedPointer<ICameraInformationCollector> m_pCameraInformationCollector;
     IPluginManager* m_pPluginManager = nullptr; // host object, not owned
     IRelaySender* m_pRelaySender = nullptr;     // host object, not owned
     // Gates the two start commands; written by the settings slot, read on request threads.

@@ -1,0 +1,88 @@
+#pragma once
+// The feature vectors of one location and one kind (body or face), kept out of SQLite: a file of
+// contiguous float32 rows (kFeatureDim per row) that the scan reads sequentially, and a parallel
+// file of small row records telling which object a row belongs to and when it was seen (so the
+// scan can skip rows outside the time window without reading them).
+//
+// Files only grow; a replaced object leaves its old row behind, and the object's row in SQLite
+// says which row is current. A crash may leave a torn tail; the writer cuts both files back to
+// the rows they both hold completely. Rows are written and synced before the SQLite commit that
+// refers to them, so every committed object finds its rows.
+//
+// Thread use: TamsaFeatureFile (the writer) only under the store's write lock; a
+// TamsaFeatureMap is immutable and shared by any number of searches.
+
+#include <cstdint>
+#include <memory>
+#include <string>
+#include <vector>
+
+namespace tamsa {
+
+constexpr size_t kFeatureDim = 512;
+constexpr size_t kFeatureRowBytes = kFeatureDim * sizeof(float);
+
+struct FeatureRowInfo
+{
+    int64_t objectRowId; // the object's SQLite rowid
+    uint32_t startTime;
+    uint32_t endTime;
+};
+static_assert(sizeof(FeatureRowInfo) == 16, "row records are 16 bytes");
+
+class TamsaFeatureFile
+{
+public:
+    TamsaFeatureFile(std::string vectorPath, std::string infoPath);
+    ~TamsaFeatureFile();
+    TamsaFeatureFile(const TamsaFeatureFile&) = delete;
+    TamsaFeatureFile& operator=(const TamsaFeatureFile&) = delete;
+
+    // Opens (creating) both files and cuts a torn tail. False on an I/O error.
+    bool open();
+    // Row index the next append gets.
+    int64_t nextRow() const { return m_rows + int64_t(m_pendingInfos.size()); }
+    // Queues one row; written by flush().
+    int64_t append(const float* vector, const FeatureRowInfo& info);
+    // Writes the queued rows and syncs both files. False on an I/O error (rows stay unwritten).
+    bool flush();
+    // Drops queued rows (the transaction that wanted them failed).
+    void discard();
+
+private:
+    std::string m_vectorPath;
+    std::string m_infoPath;
+    int m_vectorFd = -1;
+    int m_infoFd = -1;
+    int64_t m_rows = 0;
+    std::vector<float> m_pendingVectors;
+    std::vector<FeatureRowInfo> m_pendingInfos;
+};
+
+// A read-only mapping of the rows present when it was made.
+class TamsaFeatureMap
+{
+public:
+    // Maps the complete rows of both files; null when the files are missing or empty.
+    static std::shared_ptr<const TamsaFeatureMap> map(const std::string& vectorPath,
+                                                      const std::string& infoPath);
+    // Number of complete rows the files hold now (cheap: two stat calls).
+    static int64_t rowsOnDisk(const std::string& vectorPath, const std::string& infoPath);
+    ~TamsaFeatureMap();
+
+    int64_t rows() const { return m_rows; }
+    const float* vector(int64_t row) const { return m_vectors + size_t(row) * kFeatureDim; }
+    const FeatureRowInfo& info(int64_t row) const { return m_infos[row]; }
+
+private:
+    TamsaFeatureMap() = default;
+    void* m_vectorBase = nullptr;
+    size_t m_vectorBytes = 0;
+    void* m_infoBase = nullptr;
+    size_t m_infoBytes = 0;
+    const float* m_vectors = nullptr;
+    const FeatureRowInfo* m_infos = nullptr;
+    int64_t m_rows = 0;
+};
+
+} // namespace tamsa

@@ -1,0 +1,706 @@
+#include "TamsaJson.h"
+
+#include <charconv>
+#include <cmath>
+#include <cstring>
+
+namespace tamsa {
+
+namespace {
+
+// Deeper texts are refused: recursion must stay bounded whatever a camera or client sends.
+constexpr int kMaxDepth = 64;
+
+constexpr double kExactPow10[] = {1e0,  1e1,  1e2,  1e3,  1e4,  1e5,  1e6,  1e7,  1e8,  1e9,  1e10, 1e11,
+                                  1e12, 1e13, 1e14, 1e15, 1e16, 1e17, 1e18, 1e19, 1e20, 1e21, 1e22};
+
+class Parser
+{
+public:
+    Parser(const char* begin, const char* end)
+        : m_p(begin)
+        , m_end(end)
+    {}
+
+    bool parseDocument(JsonValue* out)
+    {
+        skipSpace();
+        if (!parseValue(out, 0)) {
+            return false;
+        }
+        skipSpace();
+        return m_p == m_end;
+    }
+
+private:
+    void skipSpace()
+    {
+        while (m_p < m_end && (*m_p == ' ' || *m_p == '\n' || *m_p == '\r' || *m_p == '\t')) {
+            ++m_p;
+        }
+    }
+
+    bool literal(const char* word, size_t length)
+    {
+        if (size_t(m_end - m_p) < length || std::memcmp(m_p, word, length) != 0) {
+            return false;
+        }
+        m_p += length;
+        return true;
+    }
+
+    bool parseValue(JsonValue* out, int depth)
+    {
+        if (m_p >= m_end) {
+            return false;
+        }
+        switch (*m_p) {
+        case '{':
+            return parseObject(out, depth + 1);
+        case '[':
+            return parseArray(out, depth + 1);
+        case '"':
+            out->type = JsonValue::Type::String;
+            return parseString(&out->text);
+        case 't':
+            out->type = JsonValue::Type::Bool;
+            out->boolean = true;
+            return literal("true", 4);
+        case 'f':
+            out->type = JsonValue::Type::Bool;
+            out->boolean = false;
+            return literal("false", 5);
+        case 'n':
+            out->type = JsonValue::Type::Null;
+            return literal("null", 4);
+        default: {
+            const char* start = m_p;
+            const char* next = parseNumber(m_p, m_end, &out->number);
+            if (!next) {
+                return false;
+            }
+            out->type = JsonValue::Type::Number;
+            out->text.assign(start, next);
+            m_p = next;
+            return true;
+        }
+        }
+    }
+
+    bool parseObject(JsonValue* out, int depth)
+    {
+        if (depth > kMaxDepth) {
+            return false;
+        }
+        out->type = JsonValue::Type::Object;
+        ++m_p;
+        skipSpace();
+        if (m_p < m_end && *m_p == '}') {
+            ++m_p;
+            return true;
+        }
+        for (;;) {
+            skipSpace();
+            if (m_p >= m_end || *m_p != '"') {
+                return false;
+            }
+            out->keys.emplace_back();
+            if (!parseString(&out->keys.back())) {
+                return false;
+            }
+            skipSpace();
+            if (m_p >= m_end || *m_p != ':') {
+                return false;
+            }
+            ++m_p;
+            skipSpace();
+            out->values.emplace_back();
+            if (!parseValue(&out->values.back(), depth)) {
+                return false;
+            }
+            skipSpace();
+            if (m_p >= m_end) {
+                return false;
+            }
+            if (*m_p == ',') {
+                ++m_p;
+                continue;
+            }
+            if (*m_p == '}') {
+                ++m_p;
+                return true;
+            }
+            return false;
+        }
+    }
+
+    bool parseArray(JsonValue* out, int depth)
+    {
+        if (depth > kMaxDepth) {
+            return false;
+        }
+        out->type = JsonValue::Type::Array;
+        out->numberArray = true;
+        ++m_p;
+        skipSpace();
+        if (m_p < m_end && *m_p == ']') {
+            ++m_p;
+            return true;
+        }
+        for (;;) {
+            skipSpace();
+            if (m_p >= m_end) {
+                return false;
+            }
+            const char c = *m_p;
+            if (out->numberArray && (c == '-' || (c >= '0' && c <= '9'))) {
+                double value = 0;
+                const char* next = parseNumber(m_p, m_end, &value);
+                if (!next) {
+                    return false;
+                }
+                out->numbers.push_back(value);
+                m_p = next;
+            } else {
+                if (out->numberArray) {
+                    // The first element that is not a number: fall back to a general array.
+                    out->numberArray = false;
+                    out->items.reserve(out->numbers.size() + 1);
+                    for (double number : out->numbers) {
+                        out->items.push_back(JsonValue::makeNumber(number));
+                    }
+                    out->numbers.clear();
+                    out->numbers.shrink_to_fit();
+                }
+                out->items.emplace_back();
+                if (!parseValue(&out->items.back(), depth)) {
+                    return false;
+                }
+            }
+            skipSpace();
+            if (m_p >= m_end) {
+                return false;
+            }
+            if (*m_p == ',') {
+                ++m_p;
+                continue;
+            }
+            if (*m_p == ']') {
+                ++m_p;
+                return true;
+            }
+            return false;
+        }
+    }
+
+    static int hexDigit(char c)
+    {
+        if (c >= '0' && c <= '9') {
+            return c - '0';
+        }
+        if (c >= 'a' && c <= 'f') {
+            return c - 'a' + 10;
+        }
+        if (c >= 'A' && c <= 'F') {
+            return c - 'A' + 10;
+        }
+        return -1;
+    }
+
+    bool parseHex4(unsigned* out)
+    {
+        if (m_end - m_p < 4) {
+            return false;
+        }
+        unsigned value = 0;
+        for (int i = 0; i < 4; ++i) {
+            const int digit = hexDigit(m_p[i]);
+            if (digit < 0) {
+                return false;
+            }
+            value = value * 16 + unsigned(digit);
+        }
+        m_p += 4;
+        *out = value;
+        return true;
+    }
+
+    static void appendUtf8(std::string* out, unsigned code)
+    {
+        if (code < 0x80) {
+            out->push_back(char(code));
+        } else if (code < 0x800) {
+            out->push_back(char(0xC0 | (code >> 6)));
+            out->push_back(char(0x80 | (code & 0x3F)));
+        } else if (code < 0x10000) {
+            out->push_back(char(0xE0 | (code >> 12)));
+            out->push_back(char(0x80 | ((code >> 6) & 0x3F)));
+            out->push_back(char(0x80 | (code & 0x3F)));
+        } else {
+            out->push_back(char(0xF0 | (code >> 18)));
+            out->push_back(char(0x80 | ((code >> 12) & 0x3F)));
+            out->push_back(char(0x80 | ((code >> 6) & 0x3F)));
+            out->push_back(char(0x80 | (code & 0x3F)));
+        }
+    }
+
+    bool parseString(std::string* out)
+    {
+        ++m_p; // opening quote
+        const char* runStart = m_p;
+        for (;;) {
+            if (m_p >= m_end) {
+                return false;
+            }
+            const unsigned char c = static_cast<unsigned char>(*m_p);
+            if (c == '"') {
+                out->append(runStart, m_p);
+                ++m_p;
+                return true;
+            }
+            if (c < 0x20) {
+                return false;
+            }
+            if (c != '\\') {
+                ++m_p;
+                continue;
+            }
+            out->append(runStart, m_p);
+            ++m_p;
+            if (m_p >= m_end) {
+                return false;
+            }
+            const char escape = *m_p++;
+            switch (escape) {
+            case '"':
+            case '\\':
+            case '/':
+                out->push_back(escape);
+                break;
+            case 'b':
+                out->push_back('\b');
+                break;
+            case 'f':
+                out->push_back('\f');
+                break;
+            case 'n':
+                out->push_back('\n');
+                break;
+            case 'r':
+                out->push_back('\r');
+                break;
+            case 't':
+                out->push_back('\t');
+                break;
+            case 'u': {
+                unsigned code = 0;
+                if (!parseHex4(&code)) {
+                    return false;
+                }
+                if (code >= 0xD800 && code < 0xDC00 && m_end - m_p >= 6 && m_p[0] == '\\' && m_p[1] == 'u') {
+                    const char* save = m_p;
+                    m_p += 2;
+                    unsigned low = 0;
+                    if (parseHex4(&low) && low >= 0xDC00 && low < 0xE000) {
+                        code = 0x10000 + ((code - 0xD800) << 10) + (low - 0xDC00);
+                    } else {
+                        m_p = save;
+                        code = 0xFFFD;
+                    }
+                } else if (code >= 0xD800 && code < 0xE000) {
+                    code = 0xFFFD; // a lone surrogate has no UTF-8 form
+                }
+                appendUtf8(out, code);
+                break;
+            }
+            default:
+                return false;
+            }
+            runStart = m_p;
+        }
+    }
+
+    const char* m_p;
+    const char* m_end;
+};
+
+void appendEscaped(std::string* out, const std::string& text)
+{
+    out->push_back('"');
+    size_t runStart = 0;
+    for (size_t i = 0; i < text.size(); ++i) {
+        const unsigned char c = static_cast<unsigned char>(text[i]);
+        if (c >= 0x20 && c != '"' && c != '\\') {
+            continue;
+        }
+        out->append(text, runStart, i - runStart);
+        runStart = i + 1;
+        switch (c) {
+        case '"':
+            out->append("\\\"");
+            break;
+        case '\\':
+            out->append("\\\\");
+            break;
+        case '\n':
+            out->append("\\n");
+            break;
+        case '\r':
+            out->append("\\r");
+            break;
+        case '\t':
+            out->append("\\t");
+            break;
+        default: {
+            static const char hex[] = "0123456789abcdef";
+            const char escaped[] = {'\\', 'u', '0', '0', hex[c >> 4], hex[c & 15]};
+            out->append(escaped, sizeof escaped);
+        }
+        }
+    }
+    out->append(text, runStart, std::string::npos);
+    out->push_back('"');
+}
+
+void appendDouble(std::string* out, double value)
+{
+    if (!std::isfinite(value)) {
+        out->append("null"); // JSON has no infinities; ingest refuses them, this is a last resort
+        return;
+    }
+    char buffer[40];
+    if (value == std::floor(value) && std::fabs(value) < 1e15) {
+        const auto result = std::to_chars(buffer, buffer + sizeof buffer, static_cast<long long>(value));
+        out->append(buffer, result.ptr);
+        return;
+    }
+    const auto result = std::to_chars(buffer, buffer + sizeof buffer, value);
+    out->append(buffer, result.ptr);
+}
+
+} // namespace
+
+const char* parseNumber(const char* begin, const char* end, double* value)
+{
+    const char* p = begin;
+    bool negative = false;
+    if (p < end && *p == '-') {
+        negative = true;
+        ++p;
+    }
+    if (p >= end || *p < '0' || *p > '9') {
+        return nullptr;
+    }
+    uint64_t mantissa = 0;
+    int significant = 0;
+    int exponent = 0;
+    bool exact = true;
+    auto takeDigit = [&](char c, bool fraction) {
+        if (mantissa == 0 && c == '0') {
+            if (fraction) {
+                --exponent;
+            }
+            return;
+        }
+        if (significant < 19) {
+            mantissa = mantissa * 10 + uint64_t(c - '0');
+            ++significant;
+            if (fraction) {
+                --exponent;
+            }
+        } else {
+            exact = false; // more digits than fit: the slow path rounds correctly
+            if (!fraction) {
+                ++exponent;
+            }
+        }
+    };
+    if (*p == '0') {
+        ++p; // JSON forbids leading zeros: "01" ends the number after the 0
+    } else {
+        while (p < end && *p >= '0' && *p <= '9') {
+            takeDigit(*p++, false);
+        }
+    }
+    if (p < end && *p == '.') {
+        ++p;
+        if (p >= end || *p < '0' || *p > '9') {
+            return nullptr;
+        }
+        while (p < end && *p >= '0' && *p <= '9') {
+            takeDigit(*p++, true);
+        }
+    }
+    if (p < end && (*p == 'e' || *p == 'E')) {
+        ++p;
+        bool expNegative = false;
+        if (p < end && (*p == '+' || *p == '-')) {
+            expNegative = *p == '-';
+            ++p;
+        }
+        if (p >= end || *p < '0' || *p > '9') {
+            return nullptr;
+        }
+        int written = 0;
+        while (p < end && *p >= '0' && *p <= '9') {
+            if (written < 100000) {
+                written = written * 10 + (*p - '0');
+            }
+            ++p;
+        }
+        exponent += expNegative ? -written : written;
+    }
+    if (exact && mantissa < (uint64_t(1) << 53) && exponent >= -22 && exponent <= 22) {
+        // Both the mantissa and the power of ten are exact doubles: one rounding, exact result.
+        double result = double(mantissa);
+        result = exponent < 0 ? result / kExactPow10[-exponent] : result * kExactPow10[exponent];
+        *value = negative ? -result : result;
+        return p;
+    }
+    if (mantissa == 0 && exact) {
+        *value = negative ? -0.0 : 0.0;
+        return p;
+    }
+    double result = 0;
+    const auto parsed = std::from_chars(begin, p, result);
+    if (parsed.ec == std::errc::result_out_of_range) {
+        // Overflow becomes an infinity (callers refuse it), underflow zero.
+        result = (std::fabs(result) < 1) ? 0.0 : HUGE_VAL;
+        if (negative) {
+            result = -std::fabs(result);
+        }
+    } else if (parsed.ec != std::errc() || parsed.ptr != p) {
+        return nullptr;
+    }
+    *value = result;
+    return p;
+}
+
+int formatFloat(float value, char* out)
+{
+    char* p = out;
+    if (!std::isfinite(value) || value == 0) {
+        *p++ = '0';
+        return int(p - out);
+    }
+    if (value < 0) {
+        *p++ = '-';
+        value = -value;
+    }
+    static const double kPow10[] = {
+        1e-50, 1e-49, 1e-48, 1e-47, 1e-46, 1e-45, 1e-44, 1e-43, 1e-42, 1e-41, 1e-40, 1e-39, 1e-38,
+        1e-37, 1e-36, 1e-35, 1e-34, 1e-33, 1e-32, 1e-31, 1e-30, 1e-29, 1e-28, 1e-27, 1e-26, 1e-25,
+        1e-24, 1e-23, 1e-22, 1e-21, 1e-20, 1e-19, 1e-18, 1e-17, 1e-16, 1e-15, 1e-14, 1e-13, 1e-12,
+        1e-11, 1e-10, 1e-9,  1e-8,  1e-7,  1e-6,  1e-5,  1e-4,  1e-3,  1e-2,  1e-1,  1e0,   1e1,
+        1e2,   1e3,   1e4,   1e5,   1e6,   1e7,   1e8,   1e9,   1e10,  1e11,  1e12,  1e13,  1e14,
+        1e15,  1e16,  1e17,  1e18,  1e19,  1e20,  1e21,  1e22,  1e23,  1e24,  1e25,  1e26,  1e27,
+        1e28,  1e29,  1e30,  1e31,  1e32,  1e33,  1e34,  1e35,  1e36,  1e37,  1e38,  1e39,  1e40,
+        1e41,  1e42,  1e43,  1e44,  1e45,  1e46,  1e47,  1e48,  1e49,  1e50};
+    auto pow10 = [](int k) { return kPow10[k + 50]; };
+    const double d = value;
+    // Decimal exponent k with 10^k <= d < 10^(k+1), from the binary exponent and one correction.
+    int k = int(std::floor((std::ilogb(d)) * 0.30102999566398120));
+    if (d >= pow10(k + 1)) {
+        ++k;
+    } else if (d < pow10(k)) {
+        --k;
+    }
+    // Nine significant digits always read back as the same float.
+    const int scale = 8 - k;
+    double scaled = scale >= -50 && scale <= 50 ? d * pow10(scale) : d * std::pow(10.0, scale);
+    uint64_t digits = uint64_t(scaled + 0.5);
+    if (digits >= 1000000000u) {
+        digits /= 10;
+        ++k;
+    }
+    int count = 9;
+    while (count > 1 && digits % 10 == 0) {
+        digits /= 10;
+        --count;
+    }
+    char text[9];
+    for (int i = count - 1; i >= 0; --i) {
+        text[i] = char('0' + digits % 10);
+        digits /= 10;
+    }
+    if (k >= 0 && k < 9) {
+        const int integerDigits = k + 1;
+        for (int i = 0; i < integerDigits; ++i) {
+            *p++ = i < count ? text[i] : '0';
+        }
+        if (count > integerDigits) {
+            *p++ = '.';
+            for (int i = integerDigits; i < count; ++i) {
+                *p++ = text[i];
+            }
+        }
+    } else if (k < 0 && k >= -5) {
+        *p++ = '0';
+        *p++ = '.';
+        for (int i = 0; i < -k - 1; ++i) {
+            *p++ = '0';
+        }
+        for (int i = 0; i < count; ++i) {
+            *p++ = text[i];
+        }
+    } else {
+        *p++ = text[0];
+        if (count > 1) {
+            *p++ = '.';
+            for (int i = 1; i < count; ++i) {
+                *p++ = text[i];
+            }
+        }
+        *p++ = 'e';
+        if (k < 0) {
+            *p++ = '-';
+            k = -k;
+        }
+        if (k >= 10) {
+            *p++ = char('0' + k / 10);
+        }
+        *p++ = char('0' + k % 10);
+    }
+    return int(p - out);
+}
+
+JsonValue JsonValue::arrayElement(size_t i) const
+{
+    if (numberArray) {
+        return i < numbers.size() ? makeNumber(numbers[i]) : JsonValue();
+    }
+    return i < items.size() ? items[i] : JsonValue();
+}
+
+const JsonValue* JsonValue::member(std::string_view key) const
+{
+    for (size_t i = 0; i < keys.size(); ++i) {
+        if (keys[i] == key) {
+            return &values[i];
+        }
+    }
+    return nullptr;
+}
+
+JsonValue* JsonValue::member(std::string_view key)
+{
+    return const_cast<JsonValue*>(static_cast<const JsonValue*>(this)->member(key));
+}
+
+void JsonValue::setMember(std::string_view key, JsonValue value)
+{
+    if (JsonValue* existing = member(key)) {
+        *existing = std::move(value);
+        return;
+    }
+    type = Type::Object;
+    keys.emplace_back(key);
+    values.push_back(std::move(value));
+}
+
+JsonValue JsonValue::makeString(std::string text)
+{
+    JsonValue value;
+    value.type = Type::String;
+    value.text = std::move(text);
+    return value;
+}
+
+JsonValue JsonValue::makeNumber(double number)
+{
+    JsonValue value;
+    value.type = Type::Number;
+    value.number = number;
+    return value;
+}
+
+JsonValue JsonValue::makeFloatArray(const float* values, size_t count)
+{
+    JsonValue value;
+    value.type = Type::Array;
+    value.numberArray = true;
+    value.float32 = true;
+    value.numbers.assign(values, values + count);
+    return value;
+}
+
+bool JsonValue::parse(std::string_view text, JsonValue* out)
+{
+    *out = JsonValue();
+    Parser parser(text.data(), text.data() + text.size());
+    if (!parser.parseDocument(out)) {
+        *out = JsonValue();
+        return false;
+    }
+    return true;
+}
+
+std::string JsonValue::serialize() const
+{
+    std::string out;
+    serializeTo(&out);
+    return out;
+}
+
+void JsonValue::serializeTo(std::string* out) const
+{
+    switch (type) {
+    case Type::Null:
+        out->append("null");
+        return;
+    case Type::Bool:
+        out->append(boolean ? "true" : "false");
+        return;
+    case Type::Number:
+        if (!text.empty()) {
+            out->append(text);
+        } else {
+            appendDouble(out, number);
+        }
+        return;
+    case Type::String:
+        appendEscaped(out, text);
+        return;
+    case Type::Array:
+        out->push_back('[');
+        if (numberArray) {
+            if (float32) {
+                out->reserve(out->size() + numbers.size() * 13 + 2);
+            }
+            char buffer[32];
+            for (size_t i = 0; i < numbers.size(); ++i) {
+                if (i) {
+                    out->push_back(',');
+                }
+                if (float32) {
+                    out->append(buffer, size_t(formatFloat(float(numbers[i]), buffer)));
+                } else {
+                    appendDouble(out, numbers[i]);
+                }
+            }
+        } else {
+            for (size_t i = 0; i < items.size(); ++i) {
+                if (i) {
+                    out->push_back(',');
+                }
+                items[i].serializeTo(out);
+            }
+        }
+        out->push_back(']');
+        return;
+    case Type::Object:
+        out->push_back('{');
+        for (size_t i = 0; i < keys.size(); ++i) {
+            if (i) {
+                out->push_back(',');
+            }
+            appendEscaped(out, keys[i]);
+            out->push_back(':');
+            values[i].serializeTo(out);
+        }
+        out->push_back('}');
+        return;
+    }
+}
+
+} // namespace tamsa

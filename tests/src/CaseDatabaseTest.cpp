@@ -181,6 +181,9 @@ TEST_F(CaseDatabaseTest, FileWithOnlyTheCaseTableGetsItsItemTableAndKeepsItsCase
     EXPECT_EQ(first.value("createdTime").metaType(), QMetaType::fromType<qlonglong>());
     EXPECT_EQ(cases.at(1).toMap().value("description"), "d");
     EXPECT_GT(vault.addCaseItem(2, item(0, 1)), 0);
+    // Item reads by case use an index, added to files made without it.
+    EXPECT_EQ(raw("SELECT COUNT(*) FROM sqlite_master WHERE type = 'index' AND tbl_name = 'CaseItem'"),
+              QVariantList{1});
 }
 
 TEST_F(CaseDatabaseTest, TwoInstancesOnOnePathUseTheirOwnConnectionsSideBySide)

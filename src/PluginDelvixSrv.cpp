@@ -131,6 +131,19 @@ void PluginDelvixSrv::replyNotAvailable(const char* strCommand,
     }
 }
 
+void PluginDelvixSrv::setEnableDelvix(const QVariantMap& delvixSettings)
+{
+    m_bEnableDelvix = delvixSettings.value(QStringLiteral("enable")).toBool();
+    if (m_pCameraInformationCollector) {
+        m_pCameraInformationCollector->setDelvixSettings(delvixSettings);
+    }
+    const auto state = [&delvixSettings](const char* key) {
+        return delvixSettings.value(QLatin1String(key)).toBool() ? "Enable" : "Disable";
+    };
+    DELVIX_LOG(LogFacility::LevelSetting, "%s Delvix, %s Face Delvix, %s LPR Delvix", state("enable"),
+               state("faceEnable"), state("LPREnable"));
+}
+
 AttributeRetriever::Callback PluginDelvixSrv::makeResultRelay(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
     return [this, hdlrDoRequestCB](bool bFinished, const QVariantMap& record) {

@@ -49,6 +49,11 @@ public:
                                                      const RequestSenderInfo& senderInfo,
                                                      const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
 
+public slots:
+    // Takes the delvix settings ("enable", "faceEnable", "LPREnable"): "enable" gates the
+    // two start commands; the camera directory gets the whole map.
+    void setEnableDelvix(const QVariantMap& delvixSettings);
+
 private:
     // Command handlers, in the order of the dispatch table (PluginDelvixSrv.cpp).
     void commandStartSearch(const QVariant& params, const RequestSenderInfo& senderInfo,

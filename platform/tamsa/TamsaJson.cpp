@@ -465,9 +465,10 @@ const char* parseNumber(const char* begin, const char* end, double* value)
     const auto parsed = std::from_chars(begin, p, result);
     if (parsed.ec == std::errc::result_out_of_range) {
         // Overflow becomes an infinity (callers refuse it), underflow zero.
-        result = (std::fabs(result) < 1) ? 0.0 : HUGE_VAL;
+        // The value is about 10^(exponent + significant - 1): above 1 it overflowed.
+        result = exponent + significant > 0 ? HUGE_VAL : 0.0;
         if (negative) {
-            result = -std::fabs(result);
+            result = -result;
         }
     } else if (parsed.ec != std::errc() || parsed.ptr != p) {
         return nullptr;

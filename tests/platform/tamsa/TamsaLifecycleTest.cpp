@@ -1,0 +1,303 @@
+// Ingest, durability, and the thread rules: Abort from another thread, handles used at once.
+#include "TamsaTestStore.h"
+
+#include <atomic>
+#include <chrono>
+#include <csignal>
+#include <sys/wait.h>
+#include <thread>
+#include <unistd.h>
+
+using namespace tamsatest;
+
+namespace {
+
+using Ids = std::vector<uint64_t>;
+
+class TamsaLifecycleTest : public TamsaStoreFixture
+{
+protected:
+    std::vector<ObjectSpec> manyObjects(uint64_t firstId, size_t count, bool withVectors)
+    {
+        std::vector<ObjectSpec> objects;
+        for (size_t i = 0; i < count; ++i) {
+            ObjectSpec object;
+            object.id = firstId + i;
+            object.start = uint32_t(1000 + i);
+            object.end = object.start + 3;
+            object.attributes = R"({"Gender":)" + std::to_string(i % 2) + "}";
+            if (withVectors) {
+                object.body = randomUnitVector(uint32_t(firstId + i));
+            }
+            objects.push_back(object);
+        }
+        return objects;
+    }
+};
+
+TEST_F(TamsaLifecycleTest, ReingestReplacesWithoutDuplicates)
+{
+    const std::vector<float> oldVector = randomUnitVector(1);
+    const std::vector<float> newVector = randomUnitVector(2);
+    ObjectSpec object;
+    object.id = 42;
+    object.attributes = R"({"Gender":0})";
+    object.body = oldVector;
+    ASSERT_EQ(put(1, {object}), 1);
+    object.attributes = R"({"Gender":1})";
+    object.body = newVector;
+    ASSERT_EQ(put(1, {object}), 1);
+    ObjectSpec sameIdElsewhere = object;
+    ASSERT_EQ(put(2, {sameIdElsewhere}), 1) << "the key is (location, ID)";
+
+    QuerySpec spec;
+    const std::vector<ResultCopy> results = search(spec);
+    ASSERT_EQ(results.size(), 1u);
+    EXPECT_NE(results[0].attributes.find("\"Gender\":1"), std::string::npos);
+    spec.feature = jsonArray(oldVector);
+    EXPECT_TRUE(search(spec).empty()) << "the replaced vector is no longer searched";
+    spec.feature = jsonArray(newVector);
+    EXPECT_EQ(searchIds(spec), Ids{42});
+    spec.locations = {1, 2};
+    EXPECT_EQ(search(spec).size(), 2u);
+
+    ObjectSpec twice; // the same ID twice in one answer: the later one wins
+    twice.id = 7;
+    twice.attributes = R"({"Age":"Young"})";
+    ObjectSpec later = twice;
+    later.attributes = R"({"Age":"Old"})";
+    EXPECT_EQ(put(3, {twice, later}), 1);
+    spec = QuerySpec();
+    spec.locations = {3};
+    const std::vector<ResultCopy> third = search(spec);
+    ASSERT_EQ(third.size(), 1u);
+    EXPECT_NE(third[0].attributes.find("Old"), std::string::npos);
+}
+
+TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
+{
+    EXPECT_EQ(putText(1, "not json"), TAMSA_E_BAD_JSON);
+    EXPECT_EQ(putText(1, "[]"), TAMSA_E_BAD_JSON);
+    EXPECT_EQ(putText(1, R"({"Objects":[]})"), TAMSA_E_BAD_JSON);
+    EXPECT_EQ(putText(1, R"({"ObjectMetaInfo":{}})"), TAMSA_E_BAD_JSON);
+    EXPECT_EQ(putText(1, std::string(100000, '[') + std::string(100000, ']')), TAMSA_E_BAD_JSON);
+    EXPECT_EQ(putText(1, R"({"ObjectMetaInfo":[]})"), 0);
+    EXPECT_EQ(putText(0, R"({"ObjectMetaInfo":[]})"), TAMSA_E_INVALID_ARGUMENT);
+    EXPECT_EQ(Tamsa_PutObjectMetaInfo(m_database, 1, 1, nullptr), TAMSA_E_INVALID_ARGUMENT);
+    EXPECT_EQ(Tamsa_PutObjectMetaInfo(nullptr, 1, 1, "{}"), TAMSA_E_INVALID_ARGUMENT);
+
+    ObjectSpec good;
+    good.id = 50;
+    std::string shortFeature = objectJson(good); // a 3-number feature
+    good.id = 5;
+    shortFeature.replace(shortFeature.find("\"image\""), 0, "\"feature\":[1,2,3],");
+    const std::string deep = std::string(1000, '[') + std::string(1000, ']');
+    const std::vector<std::string> bad = {
+        R"({"ObjectType":"Human","StartTime":1,"EndTime":2})",            // no ID
+        R"({"ID":"9","ObjectType":"Human","StartTime":1,"EndTime":2})",   // ID as text
+        R"({"ID":-9,"ObjectType":"Human","StartTime":1,"EndTime":2})",    // negative ID
+        R"({"ID":1e400,"ObjectType":"Human","StartTime":1,"EndTime":2})", // huge ID
+        R"({"ID":18446744073709551616,"ObjectType":"Human","StartTime":1,"EndTime":2})",
+        R"({"ID":9,"ObjectType":7,"StartTime":1,"EndTime":2})",               // type not a text
+        R"({"ID":9,"ObjectType":"Human","StartTime":"NaN","EndTime":2})",     // time not a number
+        R"({"ID":9,"ObjectType":"Human","StartTime":1e300,"EndTime":1e301})", // time out of range
+        R"({"ID":9,"ObjectType":"Human","StartTime":5,"EndTime":2})",         // ends before it starts
+        R"({"ID":9,"ObjectType":"Human","StartTime":1,"EndTime":2,"Attributes":[1]})",
+        R"({"ID":9,"ObjectType":"Human","StartTime":1,"EndTime":2,"Trajectory":[{"x":1}]})",
+        R"({"ID":9,"ObjectType":"Human","StartTime":1,"EndTime":2,"Thumbnail":{"image":1}})",
+        shortFeature,
+        "17",
+        "null",
+    };
+    std::string answer = R"({"ObjectMetaInfo":[)" + objectJson(good);
+    for (const std::string& element : bad) {
+        answer += "," + element;
+    }
+    answer += "]}";
+    EXPECT_EQ(putText(1, answer), 1) << "only the good element is stored";
+    // Nesting beyond what any camera sends makes the whole text unreadable: nothing is stored.
+    good.id = 8;
+    const std::string nested =
+        R"({"ObjectMetaInfo":[)" + objectJson(good) +
+        R"(,{"ID":9,"ObjectType":"Human","StartTime":1,"EndTime":2,"Attributes":{"a":)" + deep + "}}]}";
+    EXPECT_EQ(putText(1, nested), TAMSA_E_BAD_JSON);
+    QuerySpec spec;
+    EXPECT_EQ(searchIds(spec), Ids{5});
+
+    void* unset = nullptr;
+    unsigned char record[704] = {0xC0, 0x02};
+    ASSERT_EQ(Tamsa_InitDatabase(&unset, record, 0), TAMSA_OK);
+    EXPECT_EQ(Tamsa_PutObjectMetaInfo(unset, 1, 1, R"({"ObjectMetaInfo":[]})"), TAMSA_E_NO_STORAGE_PATH);
+    EXPECT_EQ(Tamsa_SetStoragesDBPath(unset, ""), TAMSA_E_NO_STORAGE_PATH);
+    EXPECT_EQ(Tamsa_SetStoragesDBPath(unset, "/proc/no/such/place"), TAMSA_E_IO);
+    EXPECT_EQ(Tamsa_ReleaseDatabase(&unset), TAMSA_OK);
+    EXPECT_EQ(unset, nullptr);
+    record[0] = 0;
+    EXPECT_EQ(Tamsa_InitDatabase(&unset, record, 0), TAMSA_E_INVALID_ARGUMENT);
+    EXPECT_EQ(unset, nullptr);
+}
+
+TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
+{
+    ObjectSpec object;
+    object.id = 11;
+    object.body = randomUnitVector(11);
+    ASSERT_EQ(put(1, {object}), 1);
+    Tamsa_ReleaseDatabase(&m_database);
+
+    // A child process stores an object and is killed at once, without any clean-up.
+    const pid_t child = fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        void* database = openHandle();
+        ObjectSpec inChild;
+        inChild.id = 12;
+        inChild.body = randomUnitVector(12);
+        const int32_t stored = Tamsa_PutObjectMetaInfo(database, 1, 1, answerJson({inChild}).c_str());
+        if (stored == 1) {
+            ::kill(::getpid(), SIGKILL);
+        }
+        ::_exit(3);
+    }
+    int status = 0;
+    ASSERT_EQ(waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFSIGNALED(status)) << "the child's ingest failed";
+
+    m_database = openHandle();
+    ASSERT_NE(m_database, nullptr);
+    QuerySpec spec;
+    EXPECT_EQ(searchIds(spec), (Ids{11, 12}));
+    spec.feature = jsonArray(randomUnitVector(12));
+    EXPECT_EQ(searchIds(spec), Ids{12}) << "the child's vector is on disk too";
+}
+
+TEST_F(TamsaLifecycleTest, AbortFromAnotherThreadEndsTheSearch)
+{
+    ASSERT_EQ(put(1, manyObjects(1, 3000, false)), 3000);
+    QuerySpec spec;
+    std::vector<uint32_t> locations;
+    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    void* search = nullptr;
+    ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &query, &search), TAMSA_OK);
+
+    std::atomic<int> delivered{0};
+    std::atomic<bool> abortSent{false};
+    int32_t endStatus = 0;
+    int afterAbort = 0;
+    std::thread reader([&]() {
+        TTAMSA_OBJECTMETAINFO_RESULT record{};
+        record.wSize = sizeof record;
+        while ((endStatus = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK) {
+            ++delivered;
+            if (abortSent) {
+                ++afterAbort;
+            }
+            std::this_thread::sleep_for(std::chrono::microseconds(200)); // a slow consumer
+        }
+    });
+    while (delivered < 50) {
+        std::this_thread::yield();
+    }
+    abortSent = true;
+    Tamsa_GetObjectMetaInfoAbort(search);
+    reader.join();
+    EXPECT_EQ(endStatus, TAMSA_E_ABORTED);
+    EXPECT_LE(afterAbort, 1) << "that Next or the following one ends the search";
+    EXPECT_LT(delivered.load(), 3000);
+    TTAMSA_OBJECTMETAINFO_RESULT record{};
+    record.wSize = sizeof record;
+    EXPECT_EQ(Tamsa_GetObjectMetaInfoNext(search, &record), TAMSA_E_ABORTED) << "and stays ended";
+    Tamsa_GetObjectMetaInfoClose(search);
+}
+
+TEST_F(TamsaLifecycleTest, AbortDuringAFeatureScan)
+{
+    for (uint32_t location = 1; location <= 4; ++location) {
+        ASSERT_EQ(put(location, manyObjects(location * 10000, 2000, true)), 2000);
+    }
+    QuerySpec spec;
+    spec.locations = {1, 2, 3, 4};
+    spec.feature = jsonArray(randomUnitVector(10005));
+    EXPECT_EQ(searchIds(spec), Ids{10005});
+
+    std::vector<uint32_t> locations;
+    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    // Abort lands at some point of the scan (or just before it); the Next must report it.
+    for (int delayMicroseconds : {0, 100, 300, 1000}) {
+        void* search = nullptr;
+        ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &query, &search), TAMSA_OK);
+        std::thread aborter([&]() {
+            std::this_thread::sleep_for(std::chrono::microseconds(delayMicroseconds));
+            Tamsa_GetObjectMetaInfoAbort(search);
+        });
+        TTAMSA_OBJECTMETAINFO_RESULT record{};
+        record.wSize = sizeof record;
+        int32_t status = TAMSA_OK;
+        int count = 0;
+        while ((status = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK && count < 10) {
+            ++count;
+        }
+        aborter.join();
+        if (status != TAMSA_E_ABORTED) {
+            // The scan finished before Abort arrived: the next call must see it.
+            EXPECT_EQ(status, TAMSA_E_NO_MORE_RECORDS);
+        }
+        EXPECT_EQ(Tamsa_GetObjectMetaInfoNext(search, &record), TAMSA_E_ABORTED);
+        Tamsa_GetObjectMetaInfoClose(search);
+    }
+}
+
+TEST_F(TamsaLifecycleTest, HandlesSearchAndIngestOnSeveralThreadsAtOnce)
+{
+    ASSERT_EQ(put(1, manyObjects(1, 400, true)), 400);
+    ASSERT_EQ(put(2, manyObjects(1001, 400, true)), 400);
+    QuerySpec plain;
+    plain.locations = {1, 2};
+    plain.primary = R"({"Gender":1})";
+    QuerySpec feature;
+    feature.locations = {1, 2};
+    feature.feature = jsonArray(randomUnitVector(1100));
+    const Ids expectedPlain = searchIds(plain);
+    ASSERT_EQ(expectedPlain.size(), 400u);
+    ASSERT_EQ(searchIds(feature), Ids{1100});
+
+    std::atomic<int> mismatches{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 3; ++t) {
+        threads.emplace_back([&, t]() {
+            void* handle = openHandle();
+            for (int round = 0; round < 15; ++round) {
+                int32_t status = 0;
+                std::vector<ResultCopy> results = search(t % 2 ? feature : plain, &status, handle);
+                Ids ids;
+                for (const ResultCopy& result : results) {
+                    ids.push_back(result.id);
+                }
+                if (status != TAMSA_E_NO_MORE_RECORDS || ids != (t % 2 ? Ids{1100} : expectedPlain)) {
+                    ++mismatches;
+                }
+            }
+            Tamsa_ReleaseDatabase(&handle);
+        });
+    }
+    // Meanwhile another handle keeps ingesting into a third location.
+    threads.emplace_back([&]() {
+        void* handle = openHandle();
+        for (int round = 0; round < 10; ++round) {
+            const std::string answer = answerJson(manyObjects(5000 + round * 10, 10, true));
+            if (Tamsa_PutObjectMetaInfo(handle, 1, 3, answer.c_str()) != 10) {
+                ++mismatches;
+            }
+        }
+        Tamsa_ReleaseDatabase(&handle);
+    });
+    for (std::thread& thread : threads) {
+        thread.join();
+    }
+    EXPECT_EQ(mismatches.load(), 0);
+    QuerySpec third;
+    third.locations = {3};
+    EXPECT_EQ(searchIds(third).size(), 100u);
+}
+
+} // namespace

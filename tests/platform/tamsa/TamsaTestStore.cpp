@@ -1,0 +1,210 @@
+#include "TamsaTestStore.h"
+
+#include <charconv>
+#include <cmath>
+#include <cstring>
+#include <random>
+
+namespace tamsatest {
+
+std::vector<float> randomUnitVector(uint32_t seed)
+{
+    std::mt19937 random(seed);
+    std::normal_distribution<float> normal(0.0f, 1.0f);
+    std::vector<float> vector(kDim);
+    double norm = 0;
+    for (float& value : vector) {
+        value = normal(random);
+        norm += double(value) * value;
+    }
+    for (float& value : vector) {
+        value = float(value / std::sqrt(norm));
+    }
+    return vector;
+}
+
+std::vector<float> noisyCopy(const std::vector<float>& base, float noise, uint32_t seed)
+{
+    const std::vector<float> direction = randomUnitVector(seed);
+    std::vector<float> copy(base.size());
+    for (size_t i = 0; i < base.size(); ++i) {
+        copy[i] = base[i] + noise * direction[i];
+    }
+    return copy;
+}
+
+float plainCosine(const std::vector<float>& a, const std::vector<float>& b)
+{
+    double dot = 0, na = 0, nb = 0;
+    for (size_t i = 0; i < a.size(); ++i) {
+        dot += double(a[i]) * b[i];
+        na += double(a[i]) * a[i];
+        nb += double(b[i]) * b[i];
+    }
+    return float(std::max(0.0, dot / (std::sqrt(na) * std::sqrt(nb))));
+}
+
+std::string jsonArray(const std::vector<float>& values)
+{
+    std::string text = "[";
+    char buffer[32];
+    for (size_t i = 0; i < values.size(); ++i) {
+        if (i) {
+            text += ',';
+        }
+        text.append(buffer, std::to_chars(buffer, buffer + sizeof buffer, values[i]).ptr);
+    }
+    return text + "]";
+}
+
+std::string objectJson(const ObjectSpec& object)
+{
+    std::string text = "{\"ID\":" + std::to_string(object.id) + ",\"ObjectType\":\"" + object.type +
+                       "\",\"StartTime\":" + std::to_string(object.start) +
+                       ",\"EndTime\":" + std::to_string(object.end) + ",\"Attributes\":" + object.attributes +
+                       ",\"Trajectory\":[";
+    for (size_t i = 0; i < object.trajectory.size(); ++i) {
+        text += (i ? ",{\"x\":" : "{\"x\":") + std::to_string(object.trajectory[i].first) +
+                ",\"y\":" + std::to_string(object.trajectory[i].second) + "}";
+    }
+    text += "],\"Thumbnail\":[{\"image\":\"aW1hZ2U" + std::to_string(object.id) + "\"";
+    if (!object.body.empty()) {
+        text += ",\"feature\":" + jsonArray(object.body);
+    }
+    text += "}]";
+    if (!object.face.empty()) {
+        text += ",\"FaceThumbnail\":[{\"image\":\"ZmFjZQ\",\"feature\":" + jsonArray(object.face) +
+                ",\"face_detection_info\":{\"filtered\":" + (object.faceFiltered ? "1" : "0") + "}}]";
+    }
+    if (!object.plateCrop.empty()) {
+        text += ",\"LicensePlateThumbnail\":[{\"image\":\"cGxhdGU\",\"PlateNumber\":\"" + object.plateCrop +
+                "\",\"detection_info\":{\"filtered\":0}}]";
+    }
+    return text + "}";
+}
+
+std::string answerJson(const std::vector<ObjectSpec>& objects)
+{
+    std::string text = "{\"ObjectMetaInfo\":[";
+    for (size_t i = 0; i < objects.size(); ++i) {
+        if (i) {
+            text += ',';
+        }
+        text += objectJson(objects[i]);
+    }
+    return text + "]}";
+}
+
+TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QuerySpec& spec, std::vector<uint32_t>* locationsOut)
+{
+    TTAMSA_OBJECTMETAINFO_QUERY query;
+    std::memset(&query, 0, sizeof query);
+    query.wSize = sizeof query;
+    query.dwStartTime = spec.start;
+    query.dwEndTime = spec.end;
+    *locationsOut = spec.locations;
+    locationsOut->push_back(0);
+    query.pdwLocationIds = spec.nullLocations ? nullptr : locationsOut->data();
+    auto text = [](const std::string& value) { return value.empty() ? nullptr : value.c_str(); };
+    query.pszObjectType = text(spec.type);
+    query.pszPrimaryAttributes = text(spec.primary);
+    query.pszOtherAttributes = text(spec.other);
+    query.pszTrace = text(spec.trace);
+    query.dwDuration = spec.duration;
+    query.bLoitering = spec.loitering;
+    query.bDescending = spec.descending;
+    query.nDirection = spec.direction;
+    query.bDoNotSort = spec.doNotSort;
+    query.pszFeature = text(spec.feature);
+    query.pszFaceFeature = text(spec.faceFeature);
+    query.pszPlateNumber = text(spec.plate);
+    return query;
+}
+
+void TamsaStoreFixture::SetUp()
+{
+    ASSERT_TRUE(m_dir.isValid());
+    m_database = openHandle();
+    ASSERT_NE(m_database, nullptr);
+}
+
+void TamsaStoreFixture::TearDown()
+{
+    Tamsa_ReleaseDatabase(&m_database);
+}
+
+std::string TamsaStoreFixture::storagePath() const
+{
+    return (m_dir.path() + QStringLiteral("/Server")).toStdString();
+}
+
+void* TamsaStoreFixture::openHandle() const
+{
+    unsigned char record[704] = {};
+    record[0] = 704 & 0xFF;
+    record[1] = 704 >> 8;
+    void* database = nullptr;
+    if (Tamsa_InitDatabase(&database, record, 0) != TAMSA_OK) {
+        return nullptr;
+    }
+    if (Tamsa_SetStoragesDBPath(database, storagePath().c_str()) != TAMSA_OK) {
+        Tamsa_ReleaseDatabase(&database);
+    }
+    return database;
+}
+
+int32_t TamsaStoreFixture::put(uint32_t location, const std::vector<ObjectSpec>& objects)
+{
+    return putText(location, answerJson(objects));
+}
+
+int32_t TamsaStoreFixture::putText(uint32_t location, const std::string& json)
+{
+    return Tamsa_PutObjectMetaInfo(m_database, 7, int32_t(location), json.c_str());
+}
+
+std::vector<ResultCopy> TamsaStoreFixture::search(const QuerySpec& spec, int32_t* status, void* handle)
+{
+    std::vector<uint32_t> locations;
+    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    void* search = nullptr;
+    std::vector<ResultCopy> results;
+    int32_t code = Tamsa_GetObjectMetaInfoFirst(handle ? handle : m_database, &query, &search);
+    if (code == TAMSA_OK) {
+        TTAMSA_OBJECTMETAINFO_RESULT record;
+        std::memset(&record, 0, sizeof record);
+        record.wSize = sizeof record;
+        while ((code = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK) {
+            ResultCopy copy;
+            copy.id = record.qwObjectId;
+            copy.location = record.dwLocationNumber;
+            copy.type = record.pszObjectType;
+            copy.attributes = record.pszAttributes;
+            copy.start = record.dwStartTime;
+            copy.end = record.dwEndTime;
+            copy.trajectory.assign(record.pTrajectory, record.pTrajectory + record.dwTrajectoryBytes / 8);
+            copy.thumbnails = record.pszThumbnails;
+            copy.score = record.fScore;
+            copy.faceScore = record.fFaceScore;
+            results.push_back(copy);
+        }
+        Tamsa_GetObjectMetaInfoClose(search);
+    }
+    if (status) {
+        *status = code;
+    } else {
+        EXPECT_EQ(code, TAMSA_E_NO_MORE_RECORDS);
+    }
+    return results;
+}
+
+std::vector<uint64_t> TamsaStoreFixture::searchIds(const QuerySpec& spec)
+{
+    std::vector<uint64_t> ids;
+    for (const ResultCopy& result : search(spec)) {
+        ids.push_back(result.id);
+    }
+    return ids;
+}
+
+} // namespace tamsatest

@@ -1,0 +1,97 @@
+#pragma once
+// Test helpers for the store: a fixture that owns a storage folder and a database handle, builders
+// for camera answers and query records, and copies of result records.
+
+#include "Tamsa.h"
+
+#include <QTemporaryDir>
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace tamsatest {
+
+constexpr size_t kDim = 512;
+
+// A unit vector drawn from `seed`; noisyCopy() mixes in noise of the given norm.
+std::vector<float> randomUnitVector(uint32_t seed);
+std::vector<float> noisyCopy(const std::vector<float>& base, float noise, uint32_t seed);
+float plainCosine(const std::vector<float>& a, const std::vector<float>& b);
+std::string jsonArray(const std::vector<float>& values);
+
+struct ObjectSpec
+{
+    uint64_t id = 1;
+    std::string type = "Human";
+    uint32_t start = 1000;
+    uint32_t end = 1010;
+    std::string attributes = "{}";
+    std::vector<std::pair<double, double>> trajectory;
+    std::vector<float> body;
+    std::vector<float> face;
+    bool faceFiltered = false;
+    std::string plateCrop; // non-empty: a LicensePlateThumbnail with this PlateNumber
+};
+
+std::string objectJson(const ObjectSpec& object);
+std::string answerJson(const std::vector<ObjectSpec>& objects);
+
+struct QuerySpec
+{
+    uint32_t start = 0;
+    uint32_t end = 0xFFFFFFFFu;
+    std::vector<uint32_t> locations{1};
+    bool nullLocations = false;
+    std::string type;
+    std::string primary;
+    std::string other;
+    std::string trace;
+    uint32_t duration = 0;
+    bool loitering = false;
+    bool descending = false;
+    int32_t direction = 0;
+    bool doNotSort = false;
+    std::string feature;
+    std::string faceFeature;
+    std::string plate;
+};
+
+struct ResultCopy
+{
+    uint64_t id = 0;
+    uint32_t location = 0;
+    std::string type;
+    std::string attributes;
+    uint32_t start = 0;
+    uint32_t end = 0;
+    std::vector<double> trajectory;
+    std::string thumbnails;
+    float score = 0;
+    float faceScore = 0;
+};
+
+// Builds the record; it points into `spec` and `locationsOut`, which must outlive it.
+TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QuerySpec& spec, std::vector<uint32_t>* locationsOut);
+
+class TamsaStoreFixture : public ::testing::Test
+{
+protected:
+    void SetUp() override;
+    void TearDown() override;
+
+    std::string storagePath() const;
+    // A new handle on the fixture's storage folder; the caller releases it.
+    void* openHandle() const;
+    int32_t put(uint32_t location, const std::vector<ObjectSpec>& objects);
+    int32_t putText(uint32_t location, const std::string& json);
+    // Runs a search to its end; *status gets the code that ended it (or the First failure).
+    std::vector<ResultCopy> search(const QuerySpec& spec, int32_t* status = nullptr, void* handle = nullptr);
+    std::vector<uint64_t> searchIds(const QuerySpec& spec);
+
+    QTemporaryDir m_dir;
+    void* m_database = nullptr;
+};
+
+} // namespace tamsatest

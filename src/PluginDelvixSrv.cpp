@@ -4,7 +4,10 @@
 #include "LogFacility.h"
 #include "ScopeTracer.h"
 
+#include <QMetaObject>
+#include <QRandomGenerator64>
 #include <exception>
+#include <mutex>
 
 namespace {
 
@@ -14,17 +17,52 @@ struct CommandEntry
     PluginDelvixSrv::CommandHandler handler;
 };
 
+// The reply callback of an add batch, carrying the vault the batch's case lives in, so that
+// the final step writes the items where their case is even when the path changed meanwhile.
+struct BatchReply
+{
+    HDLR_DO_REQUEST_CB client;
+    std::shared_ptr<CaseDatabase> pCaseDatabase;
+    void operator()(bool bFinal, const QString& strCode, const QString& strMessage,
+                    const QVariant& payload) const
+    {
+        if (client) {
+            client(bFinal, strCode, strMessage, payload);
+        }
+    }
+};
+
+// State of one add batch, shared by its per-item callbacks and released with the last of them.
+struct AddBatch
+{
+    std::mutex mutex;
+    int completed = 0;       // guarded by mutex: items whose answer has arrived
+    QList<QVariant> results; // guarded by mutex: item maps that may be stored, in answer order
+    int total = 0;
+    HDLR_DO_REQUEST_CB reply;
+};
+
 } // namespace
 
 PluginDelvixSrv::PluginDelvixSrv()
     : IPluginObjectBase(nullptr)
+    , m_pLifeGuard(std::make_shared<LifeGuard>())
 {
+    // Queued add-batch answers carry these types; unregistered, the final step would never run.
     registerHostMetaTypes();
+    qRegisterMetaType<QList<QVariant>>("QList<QVariant>");
+    m_pLifeGuard->pPlugin = this;
 }
 
 PluginDelvixSrv::~PluginDelvixSrv()
 {
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::~PluginDelvixSrv");
+    {
+        // Late bookmark answers find the guard empty and leave this object alone.
+        std::lock_guard<std::mutex> lock(m_pLifeGuard->mutex);
+        m_pLifeGuard->pPlugin = nullptr;
+    }
+    setCaseDatabase(nullptr);
     // The retriever goes before the collector: its running search still looks up cameras
     // through the relay until the retriever has stopped it and waited for its thread.
     m_pAttributeRetriever.reset();
@@ -52,12 +90,73 @@ bool PluginDelvixSrv::InitialPluginBase(IFrameworkTools* pTools)
         m_pPluginManager = pTools->GetPluginManager();
         m_pRelaySender = pTools->GetRelaySender();
     }
+    ConnectSignal();
     return true;
+}
+
+void PluginDelvixSrv::ConnectSignal()
+{
+    connect(this, &PluginDelvixSrv::addBookmarkResponse, this, &PluginDelvixSrv::addCaseItem,
+            Qt::AutoConnection);
 }
 
 void PluginDelvixSrv::AllPluginLoaded()
 {
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::AllPluginLoaded");
+    if (!m_pPluginManager || !m_pPluginManager->ConnectPluginSignal(
+                                 PLUGIN_ID_SERVER_INFO, "2serverDatabasePathChanged(const QString &)", this,
+                                 "1onServerDatabasePathChanged(const QString &)", 0)) {
+        DELVIX_LOG(LogFacility::LevelError,
+                   "%s, ConnectPluginSignal serverDatabasePathChanged from PluginServerInfo failure",
+                   "PluginDelvixSrv::AllPluginLoaded");
+    }
+    if (!caseDatabase()) {
+        const QString path = getServerDatabasePath();
+        if (path.isEmpty()) {
+            DELVIX_LOG(LogFacility::LevelError,
+                       "%s, server database path is empty, the case vault has no file",
+                       "PluginDelvixSrv::AllPluginLoaded");
+        }
+        setCaseDatabase(std::make_shared<CaseDatabase>(path));
+    }
+}
+
+QString PluginDelvixSrv::getServerDatabasePath()
+{
+    QObject* pServerInfo =
+        m_pPluginManager ? m_pPluginManager->GetPluginObject(PLUGIN_ID_SERVER_INFO) : nullptr;
+    if (!pServerInfo) {
+        DELVIX_LOG(LogFacility::LevelError, "%s, GetPluginObject failure",
+                   "PluginDelvixSrv::getServerDatabasePath");
+        return QString();
+    }
+    QString path;
+    QMetaObject::invokeMethod(pServerInfo, "serverDatabasePath", Qt::DirectConnection,
+                              Q_RETURN_ARG(QString, path));
+    return path;
+}
+
+void PluginDelvixSrv::onServerDatabasePathChanged(const QString& path)
+{
+    // Built before the swap: commands keep using the old vault until the new one is ready.
+    setCaseDatabase(std::make_shared<CaseDatabase>(path));
+}
+
+void PluginDelvixSrv::setCaseDatabase(std::shared_ptr<CaseDatabase> pCaseDatabase)
+{
+    std::shared_ptr<CaseDatabase> previous;
+    {
+        QMutexLocker lock(&m_caseDatabaseMutex);
+        previous = std::move(m_pCaseDatabase);
+        m_pCaseDatabase = std::move(pCaseDatabase);
+    }
+    // previous is released here, outside the lock; commands still using it hold their own copy.
+}
+
+std::shared_ptr<CaseDatabase> PluginDelvixSrv::caseDatabase() const
+{
+    QMutexLocker lock(&m_caseDatabaseMutex);
+    return m_pCaseDatabase;
 }
 
 void PluginDelvixSrv::Request(const QString& strCommand, const QVariant& params,
@@ -221,56 +320,445 @@ void PluginDelvixSrv::commandRetrieveDelvixData(const QVariant&, const RequestSe
     replyNotAvailable("retrieveDelvixData", hdlrDoRequestCB);
 }
 
-void PluginDelvixSrv::commandAddCaseWithItem(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandAddCaseWithItem(const QVariant& params, const RequestSenderInfo& senderInfo,
                                              const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("addCaseWithItem", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("addCaseWithItem", hdlrDoRequestCB);
+        return;
+    }
+    const QVariantMap map = params.toMap();
+    const int caseId = pCaseDatabase->addCase(map.value(KEY_CASE_NAME).toString(), generateCaseNumber(),
+                                              map.value(KEY_REPORTER).toString());
+    if (caseId <= 0) {
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+        return;
+    }
+    QVariantMap item = map.value(KEY_CASE_ITEM).toMap();
+    item.insert(KEY_CASE_ID, caseId);
+    handleAddCaseItem(QList<QVariant>{item}, senderInfo, hdlrDoRequestCB, pCaseDatabase);
 }
 
-void PluginDelvixSrv::commandAddCaseItem(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandAddCaseItem(const QVariant& params, const RequestSenderInfo& senderInfo,
                                          const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("addCaseItem", hdlrDoRequestCB);
+    std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("addCaseItem", hdlrDoRequestCB);
+        return;
+    }
+    handleAddCaseItem(QList<QVariant>{params.toMap()}, senderInfo, hdlrDoRequestCB, std::move(pCaseDatabase));
 }
 
-void PluginDelvixSrv::commandAddCaseWithRecordings(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandAddCaseWithRecordings(const QVariant& params,
+                                                   const RequestSenderInfo& senderInfo,
                                                    const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("addCaseWithRecordings", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("addCaseWithRecordings", hdlrDoRequestCB);
+        return;
+    }
+    const QVariantMap map = params.toMap();
+    const int caseId = pCaseDatabase->addCase(map.value(KEY_CASE_NAME).toString(), generateCaseNumber(),
+                                              map.value(KEY_REPORTER).toString());
+    if (caseId <= 0) {
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+        return;
+    }
+    handleAddCaseItem(withCaseId(map.value(KEY_CASE_ITEM).toList(), caseId), senderInfo, hdlrDoRequestCB,
+                      pCaseDatabase);
 }
 
-void PluginDelvixSrv::commandAddCaseItemFromRecordings(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandAddCaseItemFromRecordings(const QVariant& params,
+                                                       const RequestSenderInfo& senderInfo,
                                                        const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("addCaseItemFromRecordings", hdlrDoRequestCB);
+    std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("addCaseItemFromRecordings", hdlrDoRequestCB);
+        return;
+    }
+    // The case is not checked here: the vault refuses items of a case it does not hold.
+    const QVariantMap map = params.toMap();
+    handleAddCaseItem(withCaseId(map.value(KEY_CASE_ITEM).toList(), map.value(KEY_CASE_ID).toInt()),
+                      senderInfo, hdlrDoRequestCB);
 }
 
-void PluginDelvixSrv::commandUpdateCase(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandUpdateCase(const QVariant& params, const RequestSenderInfo& senderInfo,
                                         const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("updateCase", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("updateCase", hdlrDoRequestCB);
+        return;
+    }
+    const QVariantMap map = params.toMap();
+    const int caseId = map.value(KEY_CASE_ID).toInt();
+    if (!pCaseDatabase->containCase(caseId)) {
+        reply(hdlrDoRequestCB, RC_CASE_NOT_FOUND, QVariant());
+        return;
+    }
+    if (!pCaseDatabase->updateCase(caseId, map)) {
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+        return;
+    }
+    QSet<int> keptIds;
+    bool bPartialFailure = false;
+    const QList<QVariant> items = map.value(KEY_CASE_ITEM).toList();
+    for (const QVariant& element : items) {
+        const QVariantMap item = element.toMap();
+        const int itemId = item.value(KEY_ID).toInt();
+        if (pCaseDatabase->updateCaseItem(itemId, item)) {
+            keptIds.insert(itemId);
+        } else {
+            bPartialFailure = true;
+        }
+    }
+    // Every stored item that the request did not keep goes, with its bookmark.
+    QSet<int> removedIds = pCaseDatabase->getCaseItemIdSet(caseId);
+    removedIds.subtract(keptIds);
+    QList<QVariant> removedItems;
+    for (const int itemId : std::as_const(removedIds)) {
+        const QVariantMap item = pCaseDatabase->getCaseItemInfoMap(itemId);
+        pCaseDatabase->deleteCaseItem(itemId);
+        removedItems.append(item);
+    }
+    handleDeleteCaseItemBookmark(removedItems, senderInfo);
+    reply(hdlrDoRequestCB, bPartialFailure ? RC_PARTIAL_FAILURE : RC_SUCCESS,
+          QVariant(pCaseDatabase->getCaseInfoMap(caseId)));
 }
 
-void PluginDelvixSrv::commandDeleteCase(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandDeleteCase(const QVariant& params, const RequestSenderInfo& senderInfo,
                                         const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("deleteCase", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("deleteCase", hdlrDoRequestCB);
+        return;
+    }
+    const int caseId = params.toInt();
+    // Read before anything goes: the bookmarks of these items are removed afterwards.
+    const QList<QVariant> items = pCaseDatabase->getCaseItemList(caseId);
+    if (!pCaseDatabase->containCase(caseId)) {
+        reply(hdlrDoRequestCB, RC_CASE_NOT_FOUND, QVariant());
+        return;
+    }
+    if (pCaseDatabase->deleteCase(caseId)) {
+        handleDeleteCaseItemBookmark(items, senderInfo);
+        reply(hdlrDoRequestCB, RC_SUCCESS, QVariant(caseId));
+    } else {
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant(caseId));
+    }
 }
 
 void PluginDelvixSrv::commandGetCaseList(const QVariant&, const RequestSenderInfo&,
                                          const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("getCaseList", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("getCaseList", hdlrDoRequestCB);
+        return;
+    }
+    reply(hdlrDoRequestCB, RC_SUCCESS, QVariant(pCaseDatabase->getCaseList()));
 }
 
 void PluginDelvixSrv::commandRetrieveCaseModel(const QVariant&, const RequestSenderInfo&,
                                                const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("retrieveCaseModel", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("retrieveCaseModel", hdlrDoRequestCB);
+        return;
+    }
+    QVariantList cases = pCaseDatabase->getAllCase();
+    for (QVariant& element : cases) {
+        QVariantMap record = element.toMap();
+        const int caseId = record.value(KEY_CASE_ID).toInt();
+        const std::pair<QString, QString> duration = pCaseDatabase->getCaseDuration(caseId);
+        record.insert(KEY_START_TIMESTAMP, duration.first);
+        record.insert(KEY_END_TIMESTAMP, duration.second);
+        record.insert(KEY_COVER_IMAGE, QVariant(QStringList(pCaseDatabase->getCaseCoverImage(caseId))));
+        element = record;
+    }
+    reply(hdlrDoRequestCB, RC_SUCCESS, QVariant(cases));
 }
 
-void PluginDelvixSrv::commandRetrieveCaseItemModel(const QVariant&, const RequestSenderInfo&,
+void PluginDelvixSrv::commandRetrieveCaseItemModel(const QVariant& params, const RequestSenderInfo&,
                                                    const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    replyNotAvailable("retrieveCaseItemModel", hdlrDoRequestCB);
+    const std::shared_ptr<CaseDatabase> pCaseDatabase = caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("retrieveCaseItemModel", hdlrDoRequestCB);
+        return;
+    }
+    const int caseId = params.toInt();
+    QVariantMap model;
+    model.insert(KEY_CASE_INFO_MAP, pCaseDatabase->getCaseInfoMap(caseId));
+    model.insert(KEY_CASE_ITEM_LIST, pCaseDatabase->getCaseItemList(caseId));
+    reply(hdlrDoRequestCB, RC_SUCCESS, QVariant(model));
+}
+
+void PluginDelvixSrv::reply(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB, const QString& strCode,
+                            const QVariant& payload)
+{
+    if (hdlrDoRequestCB) {
+        hdlrDoRequestCB(true, strCode, QString(), payload);
+    }
+}
+
+void PluginDelvixSrv::replyNoCaseDatabase(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+{
+    DELVIX_LOG(LogFacility::LevelError, "%s, %s arrived before the case vault exists",
+               "PluginDelvixSrv::Request", strCommand);
+    reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+}
+
+QList<QVariant> PluginDelvixSrv::withCaseId(const QList<QVariant>& caseItemList, int caseId)
+{
+    QList<QVariant> items;
+    items.reserve(caseItemList.size());
+    for (const QVariant& element : caseItemList) {
+        QVariantMap item = element.toMap();
+        item.insert(KEY_CASE_ID, caseId);
+        items.append(item);
+    }
+    return items;
+}
+
+QString PluginDelvixSrv::generateCaseNumber() const
+{
+    const quint64 draw = QRandomGenerator64::global()->generate() & 0xffffffffu;
+    const quint64 scaled = (draw * 90000000u) >> 32;
+    return QStringLiteral("%1").arg(scaled + 10000000u, 8, 10, QLatin1Char('0'));
+}
+
+void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
+                                        const RequestSenderInfo& senderInfo,
+                                        HDLR_DO_REQUEST_CB hdlrDoRequestCB)
+{
+    handleAddCaseItem(caseItemList, senderInfo, std::move(hdlrDoRequestCB), caseDatabase());
+}
+
+void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
+                                        const RequestSenderInfo& senderInfo,
+                                        HDLR_DO_REQUEST_CB hdlrDoRequestCB,
+                                        std::shared_ptr<CaseDatabase> pCaseDatabase)
+{
+    if (caseItemList.isEmpty()) {
+        return;
+    }
+    auto batch = std::make_shared<AddBatch>();
+    batch->total = int(caseItemList.size());
+    batch->reply = BatchReply{std::move(hdlrDoRequestCB), std::move(pCaseDatabase)};
+    const std::shared_ptr<LifeGuard> pLifeGuard = m_pLifeGuard;
+
+    for (const QVariant& element : caseItemList) {
+        const QVariantMap item = element.toMap();
+        const QString node = item.value(KEY_NODE_ID).toString();
+        const QString relay = getRelayPath(node);
+        const QString camera = getCameraId(node);
+
+        // Counts the first answer of its item only: a bookmark plug-in that answers twice must
+        // neither count twice nor end the batch a second time.
+        auto answered = std::make_shared<std::atomic<bool>>(false);
+        HDLR_DO_REQUEST_CB itemCallback = [pLifeGuard, batch, item, relay,
+                                           answered](bool, const QString& strCode, const QString&,
+                                                     const QVariant& payload) {
+            if (answered->exchange(true)) {
+                return;
+            }
+            bool bOk = false;
+            QVariantMap result;
+            if (strCode != RC_SUCCESS) {
+                DELVIX_LOG(LogFacility::LevelError, "AddBookmark response failed: %s (%s)",
+                           qPrintable(strCode), qPrintable(relay));
+            } else {
+                result = item;
+                if (!result.contains(KEY_BOOKMARK_ID)) {
+                    result.insert(KEY_BOOKMARK_ID, payload.toMap().value(KEY_BM_BOOKMARK_ID).toString());
+                }
+                bOk = true;
+            }
+            if (batch->reply) {
+                batch->reply(false, RC_SUCCESS, QString(), QVariant());
+            }
+            std::lock_guard<std::mutex> lock(batch->mutex);
+            if (bOk) {
+                batch->results.append(result);
+            }
+            if (++batch->completed == batch->total) {
+                const QString code = batch->results.size() == batch->total ? RC_SUCCESS : RC_FAILURE;
+                std::lock_guard<std::mutex> lifeLock(pLifeGuard->mutex);
+                if (pLifeGuard->pPlugin) {
+                    emit pLifeGuard->pPlugin->addBookmarkResponse(code, batch->results, batch->reply);
+                }
+            }
+        };
+
+        if (!item.value(KEY_NEED_BOOKMARK).toBool()) {
+            itemCallback(true, RC_SUCCESS, QString(), QVariant());
+            continue;
+        }
+        QVariantMap request;
+        request.insert(KEY_BM_CAMERA_ID, camera);
+        request.insert(KEY_BM_LOCATION_ID, item.value(KEY_LOC_ID));
+        request.insert(KEY_BM_START_TIMESTAMP, item.value(KEY_START_TIMESTAMP));
+        request.insert(KEY_BM_END_TIMESTAMP, item.value(KEY_END_TIMESTAMP));
+        request.insert(KEY_BM_DESCRIPTION, QString());
+        request.insert(KEY_BM_CREATOR, QStringLiteral("admin"));
+        request.insert(KEY_BM_GROUP, QStringLiteral("CaseVault"));
+        if (relay.isEmpty()) {
+            addBookmark(request, senderInfo, itemCallback);
+        } else {
+            addSubstationBookmark(request, relay, itemCallback);
+        }
+    }
+}
+
+void PluginDelvixSrv::addCaseItem(const QString& returnCode, const QList<QVariant>& caseItemList,
+                                  HDLR_DO_REQUEST_CB hdlrDoRequestCB) const
+{
+    if (caseItemList.isEmpty()) {
+        reply(hdlrDoRequestCB, returnCode, QVariant());
+        return;
+    }
+    // The vault the batch started on; a batch reply made elsewhere uses the current one.
+    const BatchReply* pBatchReply = hdlrDoRequestCB.target<BatchReply>();
+    const std::shared_ptr<CaseDatabase> pCaseDatabase =
+        pBatchReply && pBatchReply->pCaseDatabase ? pBatchReply->pCaseDatabase : caseDatabase();
+    if (!pCaseDatabase) {
+        replyNoCaseDatabase("addCaseItem", hdlrDoRequestCB);
+        return;
+    }
+    QString code = returnCode;
+    int caseId = 0;
+    for (const QVariant& element : caseItemList) {
+        const QVariantMap item = element.toMap();
+        caseId = item.value(KEY_CASE_ID).toInt();
+        if (pCaseDatabase->addCaseItem(caseId, item) < 1) {
+            code = RC_FAILURE;
+        }
+    }
+    reply(hdlrDoRequestCB, code, QVariant(pCaseDatabase->getCaseInfoMap(caseId)));
+}
+
+QString PluginDelvixSrv::getRelayPath(const QString& strNodeId)
+{
+    if (!strNodeId.contains(QLatin1Char('/'))) {
+        return QString();
+    }
+    return strNodeId.split(QLatin1Char('/')).at(0);
+}
+
+QString PluginDelvixSrv::getCameraId(const QString& strNodeId)
+{
+    if (!strNodeId.contains(QLatin1Char('/'))) {
+        return strNodeId;
+    }
+    return strNodeId.split(QLatin1Char('/')).at(1);
+}
+
+void PluginDelvixSrv::addBookmark(const QVariantMap& request, const RequestSenderInfo& senderInfo,
+                                  const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const
+{
+    QObject* pBookmark = m_pPluginManager ? m_pPluginManager->GetPluginObject(PLUGIN_ID_BOOKMARK) : nullptr;
+    if (!pBookmark) {
+        DELVIX_LOG(LogFacility::LevelError, "%s, Load bookmarkPlugin failed", "PluginDelvixSrv::addBookmark");
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+        return;
+    }
+    if (!QMetaObject::invokeMethod(pBookmark, "AddBookmark", Qt::AutoConnection,
+                                   Q_ARG(QVariant, QVariant(request)), Q_ARG(RequestSenderInfo, senderInfo),
+                                   Q_ARG(HDLR_DO_REQUEST_CB, hdlrDoRequestCB))) {
+        DELVIX_LOG(LogFacility::LevelError, "InvokeMethod AddBookmark failed");
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+    }
+}
+
+void PluginDelvixSrv::deleteBookmark(QVariantMap request, const RequestSenderInfo& senderInfo,
+                                     HDLR_DO_REQUEST_CB hdlrDoRequestCB)
+{
+    QObject* pBookmark = m_pPluginManager ? m_pPluginManager->GetPluginObject(PLUGIN_ID_BOOKMARK) : nullptr;
+    if (!pBookmark) {
+        DELVIX_LOG(LogFacility::LevelError, "%s, Load bookmarkPlugin failed",
+                   "PluginDelvixSrv::deleteBookmark");
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+        return;
+    }
+    if (!QMetaObject::invokeMethod(pBookmark, "DeleteBookmark", Qt::AutoConnection,
+                                   Q_ARG(QVariant, QVariant(request)), Q_ARG(RequestSenderInfo, senderInfo),
+                                   Q_ARG(HDLR_DO_REQUEST_CB, hdlrDoRequestCB))) {
+        // Nobody is answered, but a bookmark left behind must at least be visible in the log.
+        DELVIX_LOG(LogFacility::LevelError, "InvokeMethod DeleteBookmark failed");
+    }
+}
+
+void PluginDelvixSrv::addSubstationBookmark(const QVariantMap& request, const QString& strRelayPath,
+                                            const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const
+{
+    const bool bSent =
+        m_pRelaySender &&
+        m_pRelaySender->RelayRequest(PLUGIN_ID_BOOKMARK, QStringLiteral("AddBookmark"), QVariant(request),
+                                     false, strRelayPath, relayResponse(hdlrDoRequestCB));
+    if (!bSent) {
+        DELVIX_LOG(LogFacility::LevelError, "Send RelayRequest AddBookmark failed: %s",
+                   qPrintable(strRelayPath));
+        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+    }
+}
+
+void PluginDelvixSrv::deleteSubstationBookmark(const QVariantMap& request, const QString& strRelayPath,
+                                               const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+{
+    const bool bSent =
+        m_pRelaySender &&
+        m_pRelaySender->RelayRequest(PLUGIN_ID_BOOKMARK, QStringLiteral("DeleteBookmark"), QVariant(request),
+                                     false, strRelayPath, relayResponse(hdlrDoRequestCB));
+    if (!bSent) {
+        DELVIX_LOG(LogFacility::LevelError, "Send RelayRequest DeleteBookmark failed: %s",
+                   qPrintable(strRelayPath));
+    }
+}
+
+HDLR_RELAY_RESPONSE_CB PluginDelvixSrv::relayResponse(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+{
+    // The remote code is not passed on: anything but success is a failure here.
+    return [hdlrDoRequestCB](bool, QVariant result, QString strReturnCode, QString, bool) {
+        if (strReturnCode == RC_SUCCESS) {
+            reply(hdlrDoRequestCB, RC_SUCCESS, result);
+        } else {
+            reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
+        }
+    };
+}
+
+void PluginDelvixSrv::handleDeleteCaseItemBookmark(const QList<QVariant>& caseItemList,
+                                                   const RequestSenderInfo& senderInfo)
+{
+    for (const QVariant& element : caseItemList) {
+        const QVariantMap item = element.toMap();
+        const QString bookmark = item.value(KEY_BOOKMARK_ID).toString();
+        if (bookmark.isEmpty()) {
+            continue;
+        }
+        const QString node = item.value(KEY_NODE_ID).toString();
+        const QString relay = getRelayPath(node);
+        HDLR_DO_REQUEST_CB callback = [node, bookmark](bool, const QString& strCode, const QString&,
+                                                       const QVariant&) {
+            if (strCode != RC_SUCCESS) {
+                DELVIX_LOG(LogFacility::LevelError,
+                           "%s, delete case item bookmark failed, nodeID: %s, bookmarkID: %s",
+                           "PluginDelvixSrv::handleDeleteCaseItemBookmark::<lambda_1>::operator ()",
+                           qPrintable(node), qPrintable(bookmark));
+            }
+        };
+        const QVariantMap request{{KEY_BM_BOOKMARK_ID, bookmark}};
+        if (relay.isEmpty()) {
+            deleteBookmark(request, senderInfo, callback);
+        } else {
+            deleteSubstationBookmark(request, relay, callback);
+        }
+    }
 }

@@ -4,6 +4,7 @@
 // reply callback of the request, now or later and from any thread.
 
 #include "AttributeRetriever.h"
+#include "CaseDatabase.h"
 #include "HostCallbacks.h"
 #include "ICameraInformationCollector.h"
 #include "IFrameworkTools.h"
@@ -11,11 +12,14 @@
 #include "IPluginObjectBase.h"
 #include "IRelaySender.h"
 
+#include <QMutex>
 #include <QObject>
 #include <QSharedPointer>
 #include <QString>
 #include <QVariant>
 #include <atomic>
+#include <memory>
+#include <mutex>
 
 class PluginDelvixSrv : public IPluginObjectBase
 {
@@ -44,15 +48,58 @@ public:
     void
     setCameraInformationCollector(QSharedPointer<ICameraInformationCollector> pCameraInformationCollector);
 
+    // Replaces the case vault; the previous one goes when the last command using it ends.
+    void setCaseDatabase(std::shared_ptr<CaseDatabase> pCaseDatabase);
+    // The server database path from the server-information plug-in; a null text without it.
+    QString getServerDatabasePath();
+
+    // Adds case items as one batch: each item that asks for a bookmark waits for it, then the
+    // items that may be stored are written and the final reply carries the case detail. One
+    // progress reply per item comes first. An empty list sends no reply at all.
+    void handleAddCaseItem(const QList<QVariant>& caseItemList, const RequestSenderInfo& senderInfo,
+                           HDLR_DO_REQUEST_CB hdlrDoRequestCB);
+    // Eight decimal digits, 10000000 to 99999999; not checked for uniqueness.
+    QString generateCaseNumber() const;
+
+    // Node identifier "relay/camera" or "camera": the relay path (empty for a local camera)
+    // and the camera identifier.
+    static QString getRelayPath(const QString& strNodeId);
+    static QString getCameraId(const QString& strNodeId);
+    // Bookmarks on this server's bookmark plug-in or, through the relay, on another server's.
+    // Each answers through the callback; the add operations answer "-1" themselves when the
+    // request cannot be made.
+    void addBookmark(const QVariantMap& request, const RequestSenderInfo& senderInfo,
+                     const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
+    void deleteBookmark(QVariantMap request, const RequestSenderInfo& senderInfo,
+                        HDLR_DO_REQUEST_CB hdlrDoRequestCB);
+    void addSubstationBookmark(const QVariantMap& request, const QString& strRelayPath,
+                               const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
+    void deleteSubstationBookmark(const QVariantMap& request, const QString& strRelayPath,
+                                  const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
+    // Removes the bookmarks of deleted case items in the background; failures are logged.
+    void handleDeleteCaseItemBookmark(const QList<QVariant>& caseItemList,
+                                      const RequestSenderInfo& senderInfo);
+
+signals:
+    void addBookmarkResponse(const QString& returnCode, const QList<QVariant>& caseItemList,
+                             HDLR_DO_REQUEST_CB hdlrDoRequestCB);
+
+public slots:
+    void onServerDatabasePathChanged(const QString& path);
+    // Takes the delvix settings ("enable", "faceEnable", "LPREnable"): "enable" gates the
+    // two start commands; the camera directory gets the whole map.
+    void setEnableDelvix(const QVariantMap& delvixSettings);
+
+private slots:
+    // Final step of an add batch, on the plug-in's thread: stores the items and replies.
+    void addCaseItem(const QString& returnCode, const QList<QVariant>& caseItemList,
+                     HDLR_DO_REQUEST_CB hdlrDoRequestCB) const;
+
+public:
     // One handler per command of the dispatch table.
     using CommandHandler = void (PluginDelvixSrv::*)(const QVariant& params,
                                                      const RequestSenderInfo& senderInfo,
                                                      const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
-
-public slots:
-    // Takes the delvix settings ("enable", "faceEnable", "LPREnable"): "enable" gates the
-    // two start commands; the camera directory gets the whole map.
-    void setEnableDelvix(const QVariantMap& delvixSettings);
 
 private:
     // Command handlers, in the order of the dispatch table (PluginDelvixSrv.cpp).
@@ -91,6 +138,21 @@ private:
     AttributeRetriever::Callback makeResultRelay(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
     QString cameraNodeID(const QString& locationId) const;
 
+    void ConnectSignal();
+    // The case vault for one command or batch step: a copy of the member taken under its lock,
+    // so a path change cannot free the vault under a running command. Null before
+    // AllPluginLoaded; the caller then answers "-1".
+    std::shared_ptr<CaseDatabase> caseDatabase() const;
+
+    // The batch on a given vault: the items are stored in the vault their case was made in.
+    void handleAddCaseItem(const QList<QVariant>& caseItemList, const RequestSenderInfo& senderInfo,
+                           HDLR_DO_REQUEST_CB hdlrDoRequestCB, std::shared_ptr<CaseDatabase> pCaseDatabase);
+    static void reply(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB, const QString& strCode,
+                      const QVariant& payload);
+    static void replyNoCaseDatabase(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
+    static QList<QVariant> withCaseId(const QList<QVariant>& caseItemList, int caseId);
+    static HDLR_RELAY_RESPONSE_CB relayResponse(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
+
     // Answer of a command whose handler is not built yet: (true, "-1", "", none), logged.
     void replyNotAvailable(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
 
@@ -98,6 +160,15 @@ private:
     QSharedPointer<ICameraInformationCollector> m_pCameraInformationCollector;
     IPluginManager* m_pPluginManager = nullptr; // host object, not owned
     IRelaySender* m_pRelaySender = nullptr;     // host object, not owned
+    // Lets answers that arrive on other threads after destruction find that the plug-in is gone.
+    struct LifeGuard
+    {
+        std::mutex mutex;
+        PluginDelvixSrv* pPlugin = nullptr; // guarded by mutex; null once destruction began
+    };
+    std::shared_ptr<LifeGuard> m_pLifeGuard;
+    mutable QMutex m_caseDatabaseMutex;            // guards m_pCaseDatabase
+    std::shared_ptr<CaseDatabase> m_pCaseDatabase; // guarded by m_caseDatabaseMutex
     // Gates the two start commands; written by the settings slot, read on request threads.
     std::atomic<bool> m_bEnableDelvix{true};
 };

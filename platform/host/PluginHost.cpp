@@ -4,7 +4,10 @@
 
 #include <QCoreApplication>
 #include <QDir>
+#include <QFile>
 #include <QFileInfo>
+#include <QJsonArray>
+#include <QJsonDocument>
 #include <QJsonObject>
 #include <QSettings>
 
@@ -19,7 +22,24 @@ PluginHost::PluginHost(const QString& strDataDir, QObject* parent)
     m_serverInfo = std::make_unique<PluginServerInfo>(databasePath);
     m_pluginManager.registerPluginObject(QString::fromLatin1(PluginServerInfo::pluginId()),
                                          m_serverInfo.get());
+    m_bookmarkPlugin =
+        std::make_unique<BookmarkPlugin>(QDir(m_strDataDir).filePath(QStringLiteral("bookmarks.json")));
+    m_pluginManager.registerPluginObject(QString::fromLatin1(BookmarkPlugin::pluginId()),
+                                         m_bookmarkPlugin.get());
     publishInstallPath(QDir(m_strDataDir).filePath(QStringLiteral("config")), m_strDataDir);
+
+    QFile config(QDir(m_strDataDir).filePath(QStringLiteral("host.json")));
+    if (config.open(QIODevice::ReadOnly)) {
+        const QJsonArray remotes = QJsonDocument::fromJson(config.readAll())
+                                       .object()
+                                       .value(QStringLiteral("remoteServers"))
+                                       .toArray();
+        for (const QJsonValue& remote : remotes) {
+            if (!remote.toString().isEmpty()) {
+                addRemoteServer(remote.toString());
+            }
+        }
+    }
     // Several requests at once, as the management server delivers them.
     m_requestPool.setMaxThreadCount(4);
 }
@@ -28,6 +48,32 @@ PluginHost::~PluginHost()
 {
     unload();
     m_pluginManager.unregisterPluginObject(QString::fromLatin1(PluginServerInfo::pluginId()));
+    m_pluginManager.unregisterPluginObject(QString::fromLatin1(BookmarkPlugin::pluginId()));
+    for (const auto& remote : m_remoteServers) {
+        m_relaySender.removeRemoteServer(remote.first);
+    }
+}
+
+BookmarkPlugin& PluginHost::addRemoteServer(const QString& strRelayPath)
+{
+    auto& remote = m_remoteServers[strRelayPath];
+    if (!remote) {
+        remote = std::make_unique<RemoteServer>();
+        // The relay path may hold characters a folder name cannot; the folder is only storage.
+        const QString folder = QString::fromLatin1(strRelayPath.toUtf8().toHex());
+        remote->bookmarkPlugin = std::make_unique<BookmarkPlugin>(
+            QDir(m_strDataDir).filePath(QStringLiteral("remotes/%1/bookmarks.json").arg(folder)));
+        remote->pluginManager.registerPluginObject(QString::fromLatin1(BookmarkPlugin::pluginId()),
+                                                   remote->bookmarkPlugin.get());
+        m_relaySender.addRemoteServer(strRelayPath, &remote->pluginManager);
+    }
+    return *remote->bookmarkPlugin;
+}
+
+BookmarkPlugin* PluginHost::remoteBookmarkPlugin(const QString& strRelayPath) const
+{
+    const auto it = m_remoteServers.find(strRelayPath);
+    return it == m_remoteServers.end() ? nullptr : it->second->bookmarkPlugin.get();
 }
 
 bool PluginHost::publishInstallPath(const QString& strSettingsDir, const QString& strInstallPath)

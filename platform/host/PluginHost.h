@@ -9,8 +9,12 @@
 //
 // Data folder: everything the server keeps lives under one folder: the server database path
 // ("<data>/database"), the store's installation directory ("<data>", so its storage is
-// "<data>/Server") published as the machine setting "INSTALL_PATH", and the bookmarks.
+// "<data>/Server") published as the machine setting "INSTALL_PATH", and the bookmarks
+// ("<data>/bookmarks.json"). Remote servers reachable through the relay are named in
+// "<data>/host.json" as {"remoteServers": ["east", ...]}; each keeps its bookmarks in
+// "<data>/remotes/<name in hex>/bookmarks.json".
 
+#include "BookmarkPlugin.h"
 #include "HostPluginManager.h"
 #include "HostRelaySender.h"
 #include "IFrameworkTools.h"
@@ -21,6 +25,7 @@
 #include <QPluginLoader>
 #include <QPointer>
 #include <QThreadPool>
+#include <map>
 #include <memory>
 
 class PluginHost : public QObject, public IFrameworkTools
@@ -48,6 +53,11 @@ public:
     HostPluginManager& pluginManager() { return m_pluginManager; }
     HostRelaySender& relaySender() { return m_relaySender; }
     PluginServerInfo& serverInfo() { return *m_serverInfo; }
+    BookmarkPlugin& bookmarkPlugin() { return *m_bookmarkPlugin; }
+    // Makes a remote server with its own bookmark plug-in reachable under strRelayPath.
+    BookmarkPlugin& addRemoteServer(const QString& strRelayPath);
+    // The bookmark plug-in of a remote server, or null.
+    BookmarkPlugin* remoteBookmarkPlugin(const QString& strRelayPath) const;
     void setNovirTunnelClient(INovirTunnelClient* client) { m_pNovirTunnelClient = client; }
 
     // The module built next to this program: <bin>/../plugins/libPluginDelvixSrv.so.
@@ -64,6 +74,13 @@ private:
     HostPluginManager m_pluginManager;
     HostRelaySender m_relaySender;
     std::unique_ptr<PluginServerInfo> m_serverInfo;
+    std::unique_ptr<BookmarkPlugin> m_bookmarkPlugin;
+    struct RemoteServer
+    {
+        HostPluginManager pluginManager;
+        std::unique_ptr<BookmarkPlugin> bookmarkPlugin;
+    };
+    std::map<QString, std::unique_ptr<RemoteServer>> m_remoteServers;
     INovirTunnelClient* m_pNovirTunnelClient = nullptr; // borrowed
     std::unique_ptr<QPluginLoader> m_loader;
     QPointer<IPluginObjectBase> m_plugin;

@@ -20,6 +20,11 @@ BookmarkPlugin::BookmarkPlugin(const QString& strStoragePath)
 
 BookmarkPlugin::~BookmarkPlugin()
 {
+    // Requests already queued are still carried out, so a deletion acknowledged to a client
+    // before shutdown is not lost with the thread.
+    if (m_thread.isRunning()) {
+        QMetaObject::invokeMethod(this, []() {}, Qt::BlockingQueuedConnection);
+    }
     m_thread.quit();
     m_thread.wait();
 }

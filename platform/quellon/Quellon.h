@@ -23,8 +23,8 @@ class Quellon
 {
 public:
     static constexpr int kMaxDepth = 64;
-    static constexpr qsizetype kMaxElements = 4 * 1024 * 1024;
-    static constexpr qsizetype kMaxInputChars = 256 * 1024 * 1024;
+    static constexpr qsizetype kMaxElements = 1024 * 1024;
+    static constexpr qsizetype kMaxInputChars = 64 * 1024 * 1024;
 
     QVariant parse(const QString& xml);
 

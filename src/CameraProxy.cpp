@@ -41,15 +41,13 @@ quint16 portOf(const QVariant& value)
 
 CameraProxy::CameraProxy()
     : CameraProxy(std::make_shared<BraskHttpClient>())
-{
-}
+{}
 
 CameraProxy::CameraProxy(std::shared_ptr<IBraskHTTPClient> httpClient)
     : QObject(nullptr)
     , m_httpClient(std::move(httpClient))
     , m_self(std::make_shared<CameraProxy*>(this))
-{
-}
+{}
 
 CameraProxy::~CameraProxy()
 {
@@ -63,7 +61,8 @@ void CameraProxy::composeRequest(QVariantMap& request)
     const QString start = request.value(kStartTimestamp).toString();
     // Percent-encoded so that no token can change the meaning of the query; unreserved characters
     // stay as they are, so URL-safe tokens go out byte for byte.
-    const QString token = QString::fromLatin1(QUrl::toPercentEncoding(request.value(kAccessToken).toString()));
+    const QString token =
+        QString::fromLatin1(QUrl::toPercentEncoding(request.value(kAccessToken).toString()));
 
     QString path = QStringLiteral("/VCA");
     if (request.contains(kMultiChannelID)) {
@@ -73,7 +72,8 @@ void CameraProxy::composeRequest(QVariantMap& request)
     if (token.isEmpty()) {
         path += QStringLiteral("/Data/DB/ObjectMeta?StartTime=%1&EndTime=%2&Info=127").arg(start, end);
     } else {
-        path += QStringLiteral("/Data/DB/ObjMeta?accessToken=%1&StartTime=%2&EndTime=%3&Info=127").arg(token, start, end);
+        path += QStringLiteral("/Data/DB/ObjMeta?accessToken=%1&StartTime=%2&EndTime=%3&Info=127")
+                    .arg(token, start, end);
     }
     request.insert(kPath, path);
 }
@@ -97,19 +97,21 @@ void CameraProxy::sendRequest(QVariantMap& request, bool dropCovered)
     queue.enqueue(request);
 }
 
-bool CameraProxy::isWithinPendingTimeRange(const QQueue<QVariantMap>& queue, const unsigned long long& endTimestamp)
+bool CameraProxy::isWithinPendingTimeRange(const QQueue<QVariantMap>& queue,
+                                           const unsigned long long& endTimestamp)
 {
     return !queue.isEmpty() && queue.last().value(kEndTimestamp).toULongLong() > endTimestamp;
 }
 
-void CameraProxy::get(const QVariantMap& request, void (CameraProxy::*handler)(const QVariantMap&,
-                                                                               QNetworkReply::NetworkError,
-                                                                               const QByteArray&, bool))
+void CameraProxy::get(const QVariantMap& request,
+                      void (CameraProxy::*handler)(const QVariantMap&, QNetworkReply::NetworkError,
+                                                   const QByteArray&, bool))
 {
     std::weak_ptr<CameraProxy*> self = m_self;
     m_httpClient->Get(
         request.value(kIp).toString(), request.value(kPath).toString(), portOf(request.value(kPort)),
-        request.value(kUseSSL).toBool(), request.value(kUsername).toString(), request.value(kPassword).toString(),
+        request.value(kUseSSL).toBool(), request.value(kUsername).toString(),
+        request.value(kPassword).toString(),
         [self, request, handler](QNetworkReply::NetworkError error, const QByteArray&, const QByteArray& body,
                                  bool flag) {
             if (const std::shared_ptr<CameraProxy*> proxy = self.lock()) {
@@ -149,10 +151,11 @@ void CameraProxy::handleHttpResponse(const QVariantMap& request, QNetworkReply::
                        "server time is synchronized.",
                        "CameraProxy::handleHttpResponse", qPrintable(cameraID));
         } else {
-            DELVIX_LOG(LogFacility::LevelError,
-                       "%s, Get camera %s object meta failed, network error: %d, parse error: %s, request: %s",
-                       "CameraProxy::handleHttpResponse", qPrintable(cameraID), int(error),
-                       qPrintable(parseError.errorString()), qPrintable(request.value(kPath).toString()));
+            DELVIX_LOG(
+                LogFacility::LevelError,
+                "%s, Get camera %s object meta failed, network error: %d, parse error: %s, request: %s",
+                "CameraProxy::handleHttpResponse", qPrintable(cameraID), int(error),
+                qPrintable(parseError.errorString()), qPrintable(request.value(kPath).toString()));
         }
     }
 
@@ -167,8 +170,9 @@ void CameraProxy::handleHttpResponse(const QVariantMap& request, QNetworkReply::
 QVariantMap CameraProxy::composePairTokenRequest(const QVariantMap& cameraRecord) const
 {
     QVariantMap request;
-    request.insert(kPath, QStringLiteral("/VCA") +
-                              QStringLiteral("/Secure/Token?method=GET&resource=/Data/DB/ObjMeta&client=NOVIR2"));
+    request.insert(kPath,
+                   QStringLiteral("/VCA") +
+                       QStringLiteral("/Secure/Token?method=GET&resource=/Data/DB/ObjMeta&client=NOVIR2"));
     request.insert(kCameraID, cameraRecord.value(QStringLiteral("Name")).toString());
     request.insert(kIp, cameraRecord.value(QStringLiteral("IP")).toString());
     request.insert(kPort, cameraRecord.value(QStringLiteral("Port")).toInt());

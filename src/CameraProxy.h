@@ -50,15 +50,17 @@ signals:
 private:
     void composeRequest(QVariantMap& request);
     void sendHttpRequest(const QVariantMap& request);
-    void handleHttpResponse(const QVariantMap& request, QNetworkReply::NetworkError error, const QByteArray& body,
-                            bool flag);
-    static bool isWithinPendingTimeRange(const QQueue<QVariantMap>& queue, const unsigned long long& endTimestamp);
+    void handleHttpResponse(const QVariantMap& request, QNetworkReply::NetworkError error,
+                            const QByteArray& body, bool flag);
+    static bool isWithinPendingTimeRange(const QQueue<QVariantMap>& queue,
+                                         const unsigned long long& endTimestamp);
     void sendPairTokenHttpRequest(const QVariantMap& request);
     void handlePairTokenHttpResponse(const QVariantMap& request, QNetworkReply::NetworkError error,
                                      const QByteArray& body, bool flag);
     // Get with a completion that reaches `handler` only while this proxy lives.
     void get(const QVariantMap& request,
-             void (CameraProxy::*handler)(const QVariantMap&, QNetworkReply::NetworkError, const QByteArray&, bool));
+             void (CameraProxy::*handler)(const QVariantMap&, QNetworkReply::NetworkError, const QByteArray&,
+                                          bool));
 
     std::shared_ptr<IBraskHTTPClient> m_httpClient;
     // Per camera ID: composed requests waiting behind the one in flight. Entries stay once made.

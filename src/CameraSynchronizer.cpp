@@ -34,13 +34,11 @@ bool readLastLine(const QString& fileName, QString* line)
 
 CameraSynchronizer::CameraSynchronizer()
     : CameraSynchronizer(std::make_shared<CameraProxy>())
-{
-}
+{}
 
 CameraSynchronizer::CameraSynchronizer(std::shared_ptr<CameraProxy> proxy)
     : CameraSynchronizer(std::move(proxy), Clock())
-{
-}
+{}
 
 CameraSynchronizer::CameraSynchronizer(std::shared_ptr<CameraProxy> proxy, Clock clock)
     : QObject(nullptr)
@@ -220,10 +218,11 @@ void CameraSynchronizer::synchronize()
         const QString accessToken = accessTokenOf(name);
         const qint64 now = nowSecond();
         // Checked on every pass too: the clock may have been set back since the file was read.
-        const qint64 delay =
-            qint64(m_delayGetObjectDataSecond) > now ? kDefaultDelayGetObjectDataSecond : m_delayGetObjectDataSecond;
+        const qint64 delay = qint64(m_delayGetObjectDataSecond) > now ? kDefaultDelayGetObjectDataSecond
+                                                                      : m_delayGetObjectDataSecond;
 
-        qint64 start = m_lastSyncMap.contains(name) ? qint64(m_lastSyncMap.value(name).toUInt()) : now - period - delay;
+        qint64 start =
+            m_lastSyncMap.contains(name) ? qint64(m_lastSyncMap.value(name).toUInt()) : now - period - delay;
         start = qMax<qint64>(start, 0); // last-sync times are unsigned; nothing lies before 1970
         const qint64 limit = (now - start > kCatchUpLimitSecond) ? start + kCatchUpLimitSecond : now - delay;
         while (start < limit) {
@@ -235,7 +234,8 @@ void CameraSynchronizer::synchronize()
     }
 }
 
-void CameraSynchronizer::receiveObjectMeta(const QString& cameraName, unsigned int time, const QVariantMap& data)
+void CameraSynchronizer::receiveObjectMeta(const QString& cameraName, unsigned int time,
+                                           const QVariantMap& data)
 {
     if (!m_camerasMap.contains(cameraName)) {
         return; // the camera left the directory meanwhile
@@ -258,7 +258,8 @@ void CameraSynchronizer::retrieveDelvixData(const QString& cameraID, qint64 star
         // Requests arrive on host threads; the maps, the proxy's queues and the HTTP client belong
         // to this object's thread. Dropped if this object is gone before it runs.
         QMetaObject::invokeMethod(
-            this, [this, cameraID, startTime, endTime]() { retrieveDelvixData(cameraID, startTime, endTime); },
+            this,
+            [this, cameraID, startTime, endTime]() { retrieveDelvixData(cameraID, startTime, endTime); },
             Qt::QueuedConnection);
         return;
     }
@@ -269,6 +270,7 @@ void CameraSynchronizer::retrieveDelvixData(const QString& cameraID, qint64 star
     if (record.isEmpty()) {
         return;
     }
-    QVariantMap request = requestFor(record, startTime, endTime, accessTokenOf(record.value(QStringLiteral("Name")).toString()));
+    QVariantMap request = requestFor(record, startTime, endTime,
+                                     accessTokenOf(record.value(QStringLiteral("Name")).toString()));
     m_cameraProxy->sendRequest(request, false);
 }

@@ -64,7 +64,8 @@ private:
     void setDelayGetObjectDataSecond();
     void connectProxy(CameraProxy* proxy);
     QString accessTokenOf(const QString& name);
-    QVariantMap requestFor(const QVariantMap& record, qint64 start, qint64 end, const QString& accessToken) const;
+    QVariantMap requestFor(const QVariantMap& record, qint64 start, qint64 end,
+                           const QString& accessToken) const;
     qint64 nowSecond() const;
 
     QVariantMap m_camerasMap; // camera name -> camera directory record

@@ -17,13 +17,11 @@ std::unique_ptr<Zelto::IProtectedAPIMgr> checked(std::unique_ptr<Zelto::IProtect
 
 TokenConverter::TokenConverter()
     : m_protectedAPIMgr(checked(Zelto::CreateProtectedAPIManager("", 0, true)))
-{
-}
+{}
 
 TokenConverter::TokenConverter(std::unique_ptr<Zelto::IProtectedAPIMgr> manager)
     : m_protectedAPIMgr(checked(std::move(manager)))
-{
-}
+{}
 
 TokenConverter::~TokenConverter() = default;
 

@@ -1,5 +1,6 @@
 #include "PluginDelvixSrv.h"
 
+#include "CameraInformationCollector.h"
 #include "DelvixKeys.h"
 #include "LogFacility.h"
 #include "ScopeTracer.h"
@@ -67,6 +68,12 @@ PluginDelvixSrv::~PluginDelvixSrv()
     // through the relay until the retriever has stopped it and waited for its thread.
     m_pAttributeRetriever.reset();
     m_pCameraInformationCollector.reset();
+    m_cameraSynchronizer.reset();
+}
+
+void PluginDelvixSrv::setCameraSynchronizer(QSharedPointer<CameraSynchronizer> pCameraSynchronizer)
+{
+    m_cameraSynchronizer = std::move(pCameraSynchronizer);
 }
 
 void PluginDelvixSrv::setAttributeRetriever(QSharedPointer<AttributeRetriever> pAttributeRetriever)
@@ -83,6 +90,13 @@ void PluginDelvixSrv::setCameraInformationCollector(
 bool PluginDelvixSrv::InitialPluginBase(IFrameworkTools* pTools)
 {
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::InitialPluginBase");
+    if (!m_cameraSynchronizer) {
+        m_cameraSynchronizer = QSharedPointer<CameraSynchronizer>(new CameraSynchronizer());
+    }
+    if (!m_pCameraInformationCollector) {
+        m_pCameraInformationCollector =
+            QSharedPointer<ICameraInformationCollector>(new CameraInformationCollector(pTools));
+    }
     if (!m_pAttributeRetriever) {
         m_pAttributeRetriever = QSharedPointer<AttributeRetriever>::create();
     }
@@ -96,8 +110,53 @@ bool PluginDelvixSrv::InitialPluginBase(IFrameworkTools* pTools)
 
 void PluginDelvixSrv::ConnectSignal()
 {
+    notifyCameraInfoToSynchronizer();
+    forwardReceiveRespData();
     connect(this, &PluginDelvixSrv::addBookmarkResponse, this, &PluginDelvixSrv::addCaseItem,
             Qt::AutoConnection);
+}
+
+void PluginDelvixSrv::notifyCameraInfoToSynchronizer()
+{
+    if (!m_pCameraInformationCollector || !m_cameraSynchronizer) {
+        return;
+    }
+    // Direct: the directory emits on the plug-in's thread, which is the synchroniser's. The
+    // synchroniser is the receiver, so the connections end with whichever of the two goes first.
+    ICameraInformationCollector* collector = m_pCameraInformationCollector.data();
+    CameraSynchronizer* synchronizer = m_cameraSynchronizer.data();
+    connect(collector, &ICameraInformationCollector::cameraInformationChanged, synchronizer,
+            &CameraSynchronizer::updateInformation, Qt::DirectConnection);
+    connect(collector, &ICameraInformationCollector::locationRemoved, synchronizer,
+            &CameraSynchronizer::removeCameraLastSync, Qt::DirectConnection);
+    connect(collector, &ICameraInformationCollector::cameraDisconnected, synchronizer,
+            &CameraSynchronizer::removeCameraLastSync, Qt::DirectConnection);
+}
+
+void PluginDelvixSrv::forwardReceiveRespData()
+{
+    if (!m_cameraSynchronizer) {
+        return;
+    }
+    connect(
+        m_cameraSynchronizer.data(), &CameraSynchronizer::receiveResponseData, m_cameraSynchronizer.data(),
+        [this](const QVariantMap& cameraInfo, uint time, const QVariantMap& data) {
+            handleReceiveCameraResponseData(cameraInfo, time, data);
+        },
+        Qt::DirectConnection);
+}
+
+void PluginDelvixSrv::handleReceiveCameraResponseData(const QVariantMap& cameraInfo, uint,
+                                                      const QVariantMap& data) const
+{
+    if (data.value(QStringLiteral("count")).toInt() <= 0 || !m_pCameraInformationCollector) {
+        return;
+    }
+    const int group = cameraInfo.value(QStringLiteral("GroupID")).toInt();
+    QString location = cameraInfo.value(QStringLiteral("Location")).toString();
+    location.remove(QStringLiteral("Loc"));
+    m_pCameraInformationCollector->writeData(group, location.toInt(nullptr, 10),
+                                             data.value(QStringLiteral("data")).toString());
 }
 
 void PluginDelvixSrv::AllPluginLoaded()
@@ -119,6 +178,12 @@ void PluginDelvixSrv::AllPluginLoaded()
         }
         setCaseDatabase(std::make_shared<CaseDatabase>(path));
     }
+}
+
+QVariantMap PluginDelvixSrv::cameraDirectory() const
+{
+    return m_pCameraInformationCollector ? m_pCameraInformationCollector->property("cameraDirectory").toMap()
+                                         : QVariantMap();
 }
 
 QString PluginDelvixSrv::getServerDatabasePath()
@@ -233,6 +298,9 @@ void PluginDelvixSrv::replyNotAvailable(const char* strCommand,
 void PluginDelvixSrv::setEnableDelvix(const QVariantMap& delvixSettings)
 {
     m_bEnableDelvix = delvixSettings.value(QStringLiteral("enable")).toBool();
+    if (m_cameraSynchronizer) {
+        m_cameraSynchronizer->setEnableDelvix(delvixSettings);
+    }
     if (m_pCameraInformationCollector) {
         m_pCameraInformationCollector->setDelvixSettings(delvixSettings);
     }
@@ -314,10 +382,17 @@ void PluginDelvixSrv::commandStopReIdSearch(const QVariant&, const RequestSender
     }
 }
 
-void PluginDelvixSrv::commandRetrieveDelvixData(const QVariant&, const RequestSenderInfo&,
-                                                const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
+void PluginDelvixSrv::commandRetrieveDelvixData(const QVariant& params, const RequestSenderInfo&,
+                                                const HDLR_DO_REQUEST_CB&)
 {
-    replyNotAvailable("retrieveDelvixData", hdlrDoRequestCB);
+    // No reply: the camera's answer is handled like a routine window. The synchroniser carries
+    // the call over to its own thread, where its maps and the HTTP client live.
+    const QVariantMap request = params.toMap();
+    if (m_cameraSynchronizer) {
+        m_cameraSynchronizer->retrieveDelvixData(request.value(KEY_NODE_ID).toString(),
+                                                 request.value(KEY_START_TIMESTAMP).toLongLong(),
+                                                 request.value(KEY_END_TIMESTAMP).toLongLong());
+    }
 }
 
 void PluginDelvixSrv::commandAddCaseWithItem(const QVariant& params, const RequestSenderInfo& senderInfo,

@@ -4,6 +4,7 @@
 // reply callback of the request, now or later and from any thread.
 
 #include "AttributeRetriever.h"
+#include "CameraSynchronizer.h"
 #include "CaseDatabase.h"
 #include "HostCallbacks.h"
 #include "ICameraInformationCollector.h"
@@ -44,6 +45,7 @@ public:
 
     // Components installed before InitialPluginBase stay; it creates only the missing ones.
     // Install them before requests arrive: request and search threads read them unguarded.
+    void setCameraSynchronizer(QSharedPointer<CameraSynchronizer> pCameraSynchronizer);
     void setAttributeRetriever(QSharedPointer<AttributeRetriever> pAttributeRetriever);
     void
     setCameraInformationCollector(QSharedPointer<ICameraInformationCollector> pCameraInformationCollector);
@@ -52,6 +54,8 @@ public:
     void setCaseDatabase(std::shared_ptr<CaseDatabase> pCaseDatabase);
     // The server database path from the server-information plug-in; a null text without it.
     QString getServerDatabasePath();
+    // The camera directory as last announced, for the development host's diagnostics.
+    Q_INVOKABLE QVariantMap cameraDirectory() const;
 
     // Adds case items as one batch: each item that asks for a bookmark waits for it, then the
     // items that may be stored are written and the final reply carries the case detail. One
@@ -86,6 +90,9 @@ signals:
 
 public slots:
     void onServerDatabasePathChanged(const QString& path);
+    // Hands a camera's fetched metadata that holds objects to the camera directory's writeData.
+    void handleReceiveCameraResponseData(const QVariantMap& cameraInfo, uint time,
+                                         const QVariantMap& data) const;
     // Takes the delvix settings ("enable", "faceEnable", "LPREnable"): "enable" gates the
     // two start commands; the camera directory gets the whole map.
     void setEnableDelvix(const QVariantMap& delvixSettings);
@@ -139,6 +146,9 @@ private:
     QString cameraNodeID(const QString& locationId) const;
 
     void ConnectSignal();
+    // Directory changes reach the synchroniser; its fetched metadata reaches the directory.
+    void notifyCameraInfoToSynchronizer();
+    void forwardReceiveRespData();
     // The case vault for one command or batch step: a copy of the member taken under its lock,
     // so a path change cannot free the vault under a running command. Null before
     // AllPluginLoaded; the caller then answers "-1".
@@ -156,6 +166,8 @@ private:
     // Answer of a command whose handler is not built yet: (true, "-1", "", none), logged.
     void replyNotAvailable(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
 
+    // Created and used on the plug-in's thread; request threads only hand work over to it.
+    QSharedPointer<CameraSynchronizer> m_cameraSynchronizer;
     QSharedPointer<AttributeRetriever> m_pAttributeRetriever;
     QSharedPointer<ICameraInformationCollector> m_pCameraInformationCollector;
     IPluginManager* m_pPluginManager = nullptr; // host object, not owned

@@ -3,6 +3,7 @@
 #include "CameraInformationCollector.h"
 #include "IFrameworkTools.h"
 #include "NovirConfigServer.h"
+#include "PluginDelvixSrv.h"
 
 #include <QCoreApplication>
 #include <QDeadlineTimer>
@@ -165,4 +166,21 @@ TEST_F(DirectoryTest, WriteDataReachesTheStore)
     collector->writeData(1, 2, body);
     ASSERT_TRUE(waitFor([&] { return server->answeredCount(QStringLiteral("InputObjectMetaInfo")) == 1; }));
     EXPECT_EQ(server->ingestedObjects(), 2);
+}
+
+TEST_F(DirectoryTest, PluginCreatesTheCollectorOnTheHostsTunnelClient)
+{
+    PluginDelvixSrv plugin;
+    ASSERT_TRUE(plugin.InitialPluginBase(tools.get()));
+    const QStringList expected = {QStringLiteral("A"), QStringLiteral("B"), QStringLiteral("E")};
+    ASSERT_TRUE(waitFor([&] { return plugin.cameraDirectory().keys() == expected; }))
+        << qPrintable(QStringList(plugin.cameraDirectory().keys()).join(','));
+
+    // A collector installed beforehand stays in place.
+    PluginDelvixSrv second;
+    auto installed = QSharedPointer<CameraInformationCollector>::create(nullptr);
+    second.setCameraInformationCollector(installed);
+    ASSERT_TRUE(second.InitialPluginBase(tools.get()));
+    EXPECT_EQ(second.cameraDirectory(), QVariantMap());
+    EXPECT_EQ(installed->getNOVIRSrvTunnelControl()->getServerAccountID(), nullptr);
 }

@@ -13,6 +13,7 @@
 
 #include <QObject>
 #include <QVariantMap>
+#include <atomic>
 #include <functional>
 #include <memory>
 
@@ -74,8 +75,8 @@ private:
     std::shared_ptr<TokenConverter> m_tokenConverter;
     int m_routineSyncPeriodSecond = kDefaultRoutineSyncPeriodSecond;
     unsigned int m_delayGetObjectDataSecond = kDefaultDelayGetObjectDataSecond;
-    bool m_enableDelvix = true;
-    QVariantMap m_pairTokenMap; // camera ID -> pair token
+    std::atomic<bool> m_enableDelvix{true}; // the host may deliver settings on any thread
+    QVariantMap m_pairTokenMap;             // camera ID -> pair token
     Clock m_clock;
     int m_timerId = 0;
 };

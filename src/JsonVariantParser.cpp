@@ -81,8 +81,14 @@ private:
         case 'n':
             *out = QVariant::fromValue(nullptr);
             return literal("null", 4);
-        default:
-            return number(out);
+        default: {
+            Number parsed;
+            if (!number(&parsed)) {
+                return false;
+            }
+            *out = parsed.integer ? QVariant(parsed.whole) : QVariant(parsed.real);
+            return true;
+        }
         }
     }
 
@@ -147,9 +153,23 @@ private:
             return true;
         }
         for (;;) {
-            list.emplace_back();
-            if (!value(&list.back(), depth)) {
-                return false;
+            skipSpace();
+            if (m_p != m_end && (*m_p == '-' || isDigit(*m_p))) {
+                // Feature vectors: numbers straight into the list, without a temporary.
+                Number parsed;
+                if (!number(&parsed)) {
+                    return false;
+                }
+                if (parsed.integer) {
+                    list.emplaceBack(parsed.whole);
+                } else {
+                    list.emplaceBack(parsed.real);
+                }
+            } else {
+                list.emplace_back();
+                if (!value(&list.back(), depth)) {
+                    return false;
+                }
             }
             skipSpace();
             if (m_p == m_end) {
@@ -168,45 +188,37 @@ private:
         }
     }
 
-    // Eight bytes at a time: is any of them a quote, a backslash, a control character or
-    // not ASCII? Thumbnail texts are long runs of base64 with none of these.
-    static bool wordHasSpecial(uint64_t word)
+    // Eight bytes at a time: thumbnail texts are long runs of base64.
+    static bool isAscii(const char* p, const char* end)
     {
-        constexpr uint64_t ones = 0x0101010101010101ull;
-        constexpr uint64_t highs = 0x8080808080808080ull;
-        const auto hasZero = [](uint64_t x) { return (x - ones) & ~x & highs; };
-        const uint64_t nonAscii = word & highs;
-        const uint64_t control = (word - ones * 0x20) & ~word & highs;
-        return (nonAscii | control | hasZero(word ^ (ones * '"')) | hasZero(word ^ (ones * '\\'))) != 0;
+        uint64_t bits = 0;
+        while (end - p >= 8) {
+            uint64_t word;
+            std::memcpy(&word, p, sizeof word);
+            bits |= word;
+            p += 8;
+        }
+        while (p != end) {
+            bits |= static_cast<unsigned char>(*p++);
+        }
+        return (bits & 0x8080808080808080ull) == 0;
     }
-
-    static bool isSpecial(unsigned char c) { return c == '"' || c == '\\' || c < 0x20 || c >= 0x80; }
 
     bool string(QString* out)
     {
         ++m_p; // opening quote
         const char* start = m_p;
-        while (m_end - m_p >= 8) {
-            uint64_t word;
-            std::memcpy(&word, m_p, sizeof word);
-            if (wordHasSpecial(word)) {
-                break;
-            }
-            m_p += 8;
-        }
-        while (m_p != m_end && !isSpecial(static_cast<unsigned char>(*m_p))) {
-            ++m_p;
-        }
-        if (m_p == m_end) {
+        const auto* quote = static_cast<const char*>(std::memchr(m_p, '"', std::size_t(m_end - m_p)));
+        if (!quote) {
             return false;
         }
-        if (*m_p == '"') {
-            *out = QString::fromLatin1(start, m_p - start);
-            ++m_p;
+        // Without escapes and in ASCII the text is the bytes as they stand (raw control
+        // characters included, which QJsonDocument takes as they are too).
+        if (!std::memchr(start, '\\', std::size_t(quote - start)) && isAscii(start, quote)) {
+            *out = QString::fromLatin1(start, quote - start);
+            m_p = quote + 1;
             return true;
         }
-        // Escapes or non-ASCII text: the careful way, from the start of the string.
-        m_p = start;
         return slowString(out);
     }
 
@@ -301,67 +313,120 @@ private:
 
     static bool isDigit(char c) { return c >= '0' && c <= '9'; }
 
-    bool number(QVariant* out)
+    // Exact powers of ten: a mantissa of at most 53 bits scaled by one of them is rounded once,
+    // so the result is the correctly rounded value that every conforming parser gives.
+    static double exactPowerOfTen(int exponent)
+    {
+        static const double powers[] = {1e0,  1e1,  1e2,  1e3,  1e4,  1e5,  1e6,  1e7,
+                                        1e8,  1e9,  1e10, 1e11, 1e12, 1e13, 1e14, 1e15,
+                                        1e16, 1e17, 1e18, 1e19, 1e20, 1e21, 1e22};
+        return powers[exponent];
+    }
+
+    struct Number
+    {
+        bool integer = false;
+        qlonglong whole = 0;
+        double real = 0;
+    };
+
+    bool number(Number* out)
     {
         const char* start = m_p;
-        bool integral = true;
+        bool negative = false;
         if (m_p != m_end && *m_p == '-') {
+            negative = true;
             ++m_p;
         }
         if (m_p == m_end || !isDigit(*m_p)) {
             return false;
         }
+        // Every digit goes into a 64-bit mantissa; with more than 19 digits it may have
+        // wrapped, and the general conversion takes over.
+        uint64_t mantissa = 0;
+        int digits = 0;
+        int exponent = 0;
+        bool integral = true;
         if (*m_p == '0') {
             ++m_p;
+            digits = 1;
         } else {
+            const char* first = m_p;
             while (m_p != m_end && isDigit(*m_p)) {
-                ++m_p;
+                mantissa = mantissa * 10 + uint64_t(*m_p++ - '0');
             }
+            digits = int(m_p - first);
         }
         if (m_p != m_end && *m_p == '.') {
             integral = false;
             ++m_p;
-            if (m_p == m_end || !isDigit(*m_p)) {
+            const char* first = m_p;
+            while (m_p != m_end && isDigit(*m_p)) {
+                mantissa = mantissa * 10 + uint64_t(*m_p++ - '0');
+            }
+            if (m_p == first) {
                 return false;
             }
-            while (m_p != m_end && isDigit(*m_p)) {
-                ++m_p;
-            }
+            digits += int(m_p - first);
+            exponent = -int(m_p - first);
         }
         if (m_p != m_end && (*m_p == 'e' || *m_p == 'E')) {
             integral = false;
             ++m_p;
+            bool negativeExponent = false;
             if (m_p != m_end && (*m_p == '+' || *m_p == '-')) {
+                negativeExponent = *m_p == '-';
                 ++m_p;
             }
             if (m_p == m_end || !isDigit(*m_p)) {
                 return false;
             }
+            int written = 0;
             while (m_p != m_end && isDigit(*m_p)) {
+                written = written < 100000 ? written * 10 + (*m_p - '0') : written;
                 ++m_p;
             }
+            exponent += negativeExponent ? -written : written;
         }
-        if (integral) {
-            long long whole = 0;
-            const auto [end, error] = std::from_chars(start, m_p, whole);
-            if (error == std::errc() && end == m_p) {
-                *out = QVariant(static_cast<qlonglong>(whole));
-                return true;
-            }
+
+        if (integral && digits <= 18) {
+            out->integer = true;
+            out->whole = negative ? -qlonglong(mantissa) : qlonglong(mantissa);
+            return true;
         }
         double real = 0;
-        const auto [end, error] = std::from_chars(start, m_p, real);
-        // Out of range, or so small that it loses precision: QJsonDocument decides.
-        if (error != std::errc() || end != m_p || (real != 0 && !std::isnormal(real))) {
-            return false;
+        if (digits <= 19 && mantissa <= (uint64_t(1) << 53) && exponent >= -22 && exponent <= 22) {
+            real = double(mantissa);
+            real = exponent < 0 ? real / exactPowerOfTen(-exponent) : real * exactPowerOfTen(exponent);
+            real = negative ? -real : real;
+        } else {
+            if (integral) {
+                long long whole = 0;
+                const auto [end, error] = std::from_chars(start, m_p, whole);
+                if (error == std::errc() && end == m_p) {
+                    out->integer = true;
+                    out->whole = whole;
+                    return true;
+                }
+            }
+            const auto [end, error] = std::from_chars(start, m_p, real);
+            // Out of range, or so small that it loses precision: QJsonDocument decides.
+            if (error != std::errc() || end != m_p || (real != 0 && !std::isnormal(real))) {
+                return false;
+            }
         }
         // QJsonDocument keeps a number that has an exact 64-bit integer value as an integer.
         constexpr double twoTo63 = 9223372036854775808.0;
-        if (real >= -twoTo63 && real < twoTo63 && real == std::trunc(real)) {
-            *out = QVariant(static_cast<qlonglong>(real));
-        } else {
-            *out = QVariant(real);
+        if (real >= -twoTo63 && real < twoTo63) {
+            const qlonglong whole = static_cast<qlonglong>(real);
+            if (static_cast<double>(whole) == real) {
+                out->integer = true;
+                out->whole = whole;
+                return true;
+            }
         }
+        out->integer = false;
+        out->real = real;
         return true;
     }
 

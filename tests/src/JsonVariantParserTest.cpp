@@ -184,6 +184,16 @@ TEST(JsonVariantParserTest, AgreesWithQJsonDocumentOnEdgeCases)
         SCOPED_TRACE(text.constData());
         expectAgreement(text);
     }
+    // Raw control characters inside texts, with and without escapes beside them.
+    for (char control = 1; control < 0x20; ++control) {
+        expectAgreement(QByteArray("[\"a") + control + "b\"]");
+        expectAgreement(QByteArray("[\"\\n") + control + "\"]");
+    }
+    for (const char* number : {"0e500", "0.0e-500", "-0e0", "1.0000000000000000000001", "123456789012345678",
+                               "1234567890123456789", "0.1234567890123456789", "9007199254740993",
+                               "9007199254740993.0", "1e22", "1e23", "-1e-22", "0.000001"}) {
+        expectAgreement(QByteArray("[") + number + "]");
+    }
     bool ok = true;
     EXPECT_FALSE(JsonVariantParser::parse(nullptr, 0, &ok).isValid());
     EXPECT_FALSE(ok);

@@ -74,6 +74,13 @@ void CameraSimulator::stop()
     m_thread.reset();
 }
 
+void CameraSimulator::runOnCameraThread(const std::function<void()>& work)
+{
+    if (m_context) {
+        QMetaObject::invokeMethod(m_context, work, Qt::BlockingQueuedConnection);
+    }
+}
+
 SimulatedCamera* CameraSimulator::find(const QString& camera) const
 {
     for (SimulatedCamera* c : m_cameras) {

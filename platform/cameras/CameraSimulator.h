@@ -23,6 +23,7 @@
 #include <QMutex>
 #include <QObject>
 #include <QVariantMap>
+#include <functional>
 #include <memory>
 
 class QThread;
@@ -56,6 +57,8 @@ public:
     QVariantMap directoryRecord(const QString& camera, int channel = -1) const;
 
     const ObjectGenerator& generator() const { return m_generator; }
+    // Runs work on the cameras' thread and waits for it (benchmarks read that thread's CPU time).
+    void runOnCameraThread(const std::function<void()>& work);
 
 private:
     SimulatedCamera* find(const QString& camera) const;

@@ -5,7 +5,8 @@
 
 struct CameraSpec
 {
-    QString name; // camera ID, the "Name" of its directory record
+    QString name;     // camera ID, the "Name" of its directory record
+    quint16 port = 0; // 0: an ephemeral port; a fixed one for the cameras of a site file
     QString user = QStringLiteral("admin");
     QString password = QStringLiteral("admin");
     bool protectedMetadata = false; // metadata only with a valid access token, 403 otherwise

@@ -96,9 +96,9 @@ bool SimulatedCamera::listenOnLoopback(QString* error)
     if (m_spec.useSSL) {
         sslSetup(QSslCertificate(QByteArray(kCertificatePem)), QSslKey(QByteArray(kPrivateKeyPem), QSsl::Ec));
     }
-    m_port = listen(QHostAddress::LocalHost, 0);
+    m_port = listen(QHostAddress::LocalHost, m_spec.port);
     if (m_port == 0 && error) {
-        *error = QStringLiteral("camera %1 cannot listen on 127.0.0.1").arg(m_spec.name);
+        *error = QStringLiteral("camera %1 cannot listen on 127.0.0.1:%2").arg(m_spec.name).arg(m_spec.port);
     }
     return m_port != 0;
 }

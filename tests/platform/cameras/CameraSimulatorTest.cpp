@@ -9,6 +9,7 @@
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
+#include <QTcpServer>
 #include <QUrl>
 #include <QtEndian>
 #include <gtest/gtest.h>
@@ -220,6 +221,27 @@ TEST_F(CameraSimulatorTest, ChannelsAuthenticationAndBadWindows)
     EXPECT_EQ(QByteArray::fromHex(channel.value("Password").toString().toLatin1()), "admin");
     EXPECT_TRUE(directory.value("vault").toMap().value("DelvixProtect").toBool());
     EXPECT_FALSE(directory.value("door").toMap().contains("MultiChannelID"));
+}
+
+TEST(CameraSimulatorPorts, FixedPortIsUsedAndATakenOneIsReported)
+{
+    quint16 free = 0;
+    {
+        QTcpServer probe;
+        ASSERT_TRUE(probe.listen(QHostAddress::LocalHost, 0));
+        free = probe.serverPort();
+    }
+    CameraSpec spec;
+    spec.name = QStringLiteral("fixed");
+    spec.port = free;
+    CameraSimulator first;
+    ASSERT_TRUE(first.start({spec}));
+    EXPECT_EQ(first.port("fixed"), free);
+    CameraSimulator second;
+    QString error;
+    EXPECT_FALSE(second.start({spec}, &error));
+    EXPECT_TRUE(error.contains(QString::number(free))) << qPrintable(error);
+    EXPECT_EQ(second.port("fixed"), 0);
 }
 
 TEST_F(CameraSimulatorTest, SwitchesMakeACameraFailMisbehaveOrSlow)

@@ -457,27 +457,32 @@ void AttributeQueryWorker::reId(const QVariantMap& params, const Callback& callb
         return sub;
     };
 
-    bool searched = false;
-    if (m_bParallel.load() && !locations.isEmpty()) {
-        try {
-            boost::asio::thread_pool pool(static_cast<std::size_t>(m_periods.load()));
-            for (const QString& location : locations) {
-                boost::asio::post(pool, [this, sub = subRequest(location), callback]() {
+    try {
+        std::unique_ptr<boost::asio::thread_pool> pool;
+        if (m_bParallel.load() && !locations.isEmpty()) {
+            try {
+                pool = std::make_unique<boost::asio::thread_pool>(static_cast<std::size_t>(m_periods.load()));
+            } catch (const std::exception& e) {
+                // No threads to be had: the locations are searched here instead.
+                DELVIX_LOG(LogFacility::LevelError, "%s, thread pool failed: %s",
+                           "AttributeQueryWorker::reId", e.what());
+            }
+        }
+        for (const QString& location : locations) {
+            if (pool) {
+                boost::asio::post(*pool, [this, sub = subRequest(location), callback]() {
                     partialReIdSearch(sub, callback);
                 });
+            } else {
+                partialReIdSearch(subRequest(location), callback);
             }
-            pool.join();
-            searched = true;
-        } catch (const std::exception& e) {
-            // The pool's threads could not be made: the locations are searched here instead.
-            DELVIX_LOG(LogFacility::LevelError, "%s, thread pool failed: %s", "AttributeQueryWorker::reId",
-                       e.what());
         }
-    }
-    if (!searched) {
-        for (const QString& location : locations) {
-            partialReIdSearch(subRequest(location), callback);
+        if (pool) {
+            pool->join();
         }
+    } catch (const std::exception& e) {
+        // Whatever ran has delivered its hits; the final call still follows.
+        DELVIX_LOG(LogFacility::LevelError, "%s, search failed: %s", "AttributeQueryWorker::reId", e.what());
     }
     finishSearch();
     deliver(callback, true, QVariantMap());

@@ -25,7 +25,8 @@
 //
 // Storage: files under the directory given to Tamsa_SetStoragesDBPath (created on first use).
 // Tamsa_PutObjectMetaInfo returns only after the objects it counts are on disk: they survive a
-// crash of the process. One process at a time should write a storage directory.
+// crash of the process (set TAMSA_SYNC=full to also sync them to the device, surviving a power
+// loss, at a much lower ingest rate). Several processes may share a directory.
 
 #include <cstddef>
 #include <cstdint>

@@ -96,7 +96,7 @@ int64_t TamsaFeatureFile::append(const float* vector, const FeatureRowInfo& info
     return row;
 }
 
-bool TamsaFeatureFile::flush()
+bool TamsaFeatureFile::flush(bool sync)
 {
     if (m_pendingInfos.empty()) {
         return true;
@@ -105,7 +105,7 @@ bool TamsaFeatureFile::flush()
                              off_t(m_rows * int64_t(kFeatureRowBytes))) &&
                     writeAll(m_infoFd, m_pendingInfos.data(), m_pendingInfos.size() * sizeof(FeatureRowInfo),
                              off_t(m_rows * int64_t(sizeof(FeatureRowInfo)))) &&
-                    ::fdatasync(m_vectorFd) == 0 && ::fdatasync(m_infoFd) == 0;
+                    (!sync || (::fdatasync(m_vectorFd) == 0 && ::fdatasync(m_infoFd) == 0));
     if (ok) {
         m_rows += int64_t(m_pendingInfos.size());
     }

@@ -6,8 +6,8 @@
 //
 // Files only grow; a replaced object leaves its old row behind, and the object's row in SQLite
 // says which row is current. A crash may leave a torn tail; the writer cuts both files back to
-// the rows they both hold completely. Rows are written and synced before the SQLite commit that
-// refers to them, so every committed object finds its rows.
+// the rows they both hold completely. Rows are written before the SQLite commit that refers to
+// them, so every committed object finds its rows after a crash of the process.
 //
 // Thread use: TamsaFeatureFile (the writer) only under the store's write lock; a
 // TamsaFeatureMap is immutable and shared by any number of searches.
@@ -44,8 +44,8 @@ public:
     int64_t nextRow() const { return m_rows + int64_t(m_pendingInfos.size()); }
     // Queues one row; written by flush().
     int64_t append(const float* vector, const FeatureRowInfo& info);
-    // Writes the queued rows and syncs both files. False on an I/O error (rows stay unwritten).
-    bool flush();
+    // Writes the queued rows (and with `sync` forces them to the device). False on an I/O error.
+    bool flush(bool sync);
     // Drops queued rows (the transaction that wanted them failed).
     void discard();
 

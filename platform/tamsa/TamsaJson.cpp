@@ -477,10 +477,34 @@ const char* parseNumber(const char* begin, const char* end, double* value)
     return p;
 }
 
+namespace {
+
+const char kDigitPairs[201] =
+    "00010203040506070809101112131415161718192021222324252627282930313233343536373839"
+    "40414243444546474849505152535455565758596061626364656667686970717273747576777879"
+    "8081828384858687888990919293949596979899";
+
+struct Powers
+{
+    double values[101]; // 10^-50 .. 10^50
+    Powers()
+    {
+        for (int i = 0; i < 101; ++i) {
+            values[i] = std::pow(10.0, i - 50);
+        }
+    }
+};
+const Powers g_powers;
+
+} // namespace
+
 int formatFloat(float value, char* out)
 {
+    // Runs for every number of every vector a search hands out, so it avoids loops over digits
+    // and divisions: nine significant digits (always enough to read back the same float),
+    // written two at a time, trailing zeros dropped.
     char* p = out;
-    if (!std::isfinite(value) || value == 0) {
+    if (!(value != 0) || !std::isfinite(value)) {
         *p++ = '0';
         return int(p - out);
     }
@@ -488,41 +512,43 @@ int formatFloat(float value, char* out)
         *p++ = '-';
         value = -value;
     }
-    static const double kPow10[] = {
-        1e-50, 1e-49, 1e-48, 1e-47, 1e-46, 1e-45, 1e-44, 1e-43, 1e-42, 1e-41, 1e-40, 1e-39, 1e-38,
-        1e-37, 1e-36, 1e-35, 1e-34, 1e-33, 1e-32, 1e-31, 1e-30, 1e-29, 1e-28, 1e-27, 1e-26, 1e-25,
-        1e-24, 1e-23, 1e-22, 1e-21, 1e-20, 1e-19, 1e-18, 1e-17, 1e-16, 1e-15, 1e-14, 1e-13, 1e-12,
-        1e-11, 1e-10, 1e-9,  1e-8,  1e-7,  1e-6,  1e-5,  1e-4,  1e-3,  1e-2,  1e-1,  1e0,   1e1,
-        1e2,   1e3,   1e4,   1e5,   1e6,   1e7,   1e8,   1e9,   1e10,  1e11,  1e12,  1e13,  1e14,
-        1e15,  1e16,  1e17,  1e18,  1e19,  1e20,  1e21,  1e22,  1e23,  1e24,  1e25,  1e26,  1e27,
-        1e28,  1e29,  1e30,  1e31,  1e32,  1e33,  1e34,  1e35,  1e36,  1e37,  1e38,  1e39,  1e40,
-        1e41,  1e42,  1e43,  1e44,  1e45,  1e46,  1e47,  1e48,  1e49,  1e50};
-    auto pow10 = [](int k) { return kPow10[k + 50]; };
+    const double* pow10 = g_powers.values + 50;
+    uint32_t bits = 0;
+    std::memcpy(&bits, &value, sizeof bits);
+    if ((bits >> 23) == 0) {
+        // subnormal: rare enough for the exact library routine
+        return int(std::to_chars(p, p + 24, value).ptr - out);
+    }
+    // Decimal exponent k with 10^k <= d < 10^(k+1): floor(e2 * log10(2)) is off by at most one.
+    int k = ((int((bits >> 23) & 0xFF) - 127) * 1233) >> 12;
     const double d = value;
-    // Decimal exponent k with 10^k <= d < 10^(k+1), from the binary exponent and one correction.
-    int k = int(std::floor((std::ilogb(d)) * 0.30102999566398120));
-    if (d >= pow10(k + 1)) {
-        ++k;
-    } else if (d < pow10(k)) {
-        --k;
-    }
-    // Nine significant digits always read back as the same float.
-    const int scale = 8 - k;
-    double scaled = scale >= -50 && scale <= 50 ? d * pow10(scale) : d * std::pow(10.0, scale);
-    uint64_t digits = uint64_t(scaled + 0.5);
+    k += d >= pow10[k + 1] ? 1 : 0;
+    k -= d < pow10[k] ? 1 : 0;
+    uint32_t digits = uint32_t(d * pow10[8 - k] + 0.5);
     if (digits >= 1000000000u) {
-        digits /= 10;
+        digits = 100000000u;
         ++k;
     }
+    char text[10];
+    const uint32_t high = digits / 10000000u; // the first two digits
+    const uint32_t low = digits % 10000000u;
+    std::memcpy(text, kDigitPairs + 2 * high, 2);
+    std::memcpy(text + 2, kDigitPairs + 2 * (low / 100000u), 2);
+    std::memcpy(text + 4, kDigitPairs + 2 * ((low / 1000u) % 100u), 2);
+    std::memcpy(text + 6, kDigitPairs + 2 * ((low / 10u) % 100u), 2);
+    text[8] = char('0' + low % 10u);
     int count = 9;
-    while (count > 1 && digits % 10 == 0) {
-        digits /= 10;
+    while (count > 1 && text[count - 1] == '0') {
         --count;
     }
-    char text[9];
-    for (int i = count - 1; i >= 0; --i) {
-        text[i] = char('0' + digits % 10);
-        digits /= 10;
+    if (k < 0 && k >= -5) {
+        *p++ = '0';
+        *p++ = '.';
+        for (int i = 0; i < -k - 1; ++i) {
+            *p++ = '0';
+        }
+        std::memcpy(p, text, size_t(count));
+        return int(p + count - out);
     }
     if (k >= 0 && k < 9) {
         const int integerDigits = k + 1;
@@ -531,37 +557,26 @@ int formatFloat(float value, char* out)
         }
         if (count > integerDigits) {
             *p++ = '.';
-            for (int i = integerDigits; i < count; ++i) {
-                *p++ = text[i];
-            }
+            std::memcpy(p, text + integerDigits, size_t(count - integerDigits));
+            p += count - integerDigits;
         }
-    } else if (k < 0 && k >= -5) {
-        *p++ = '0';
-        *p++ = '.';
-        for (int i = 0; i < -k - 1; ++i) {
-            *p++ = '0';
-        }
-        for (int i = 0; i < count; ++i) {
-            *p++ = text[i];
-        }
-    } else {
-        *p++ = text[0];
-        if (count > 1) {
-            *p++ = '.';
-            for (int i = 1; i < count; ++i) {
-                *p++ = text[i];
-            }
-        }
-        *p++ = 'e';
-        if (k < 0) {
-            *p++ = '-';
-            k = -k;
-        }
-        if (k >= 10) {
-            *p++ = char('0' + k / 10);
-        }
-        *p++ = char('0' + k % 10);
+        return int(p - out);
     }
+    *p++ = text[0];
+    if (count > 1) {
+        *p++ = '.';
+        std::memcpy(p, text + 1, size_t(count - 1));
+        p += count - 1;
+    }
+    *p++ = 'e';
+    if (k < 0) {
+        *p++ = '-';
+        k = -k;
+    }
+    if (k >= 10) {
+        *p++ = char('0' + k / 10);
+    }
+    *p++ = char('0' + k % 10);
     return int(p - out);
 }
 

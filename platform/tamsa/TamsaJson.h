@@ -68,7 +68,7 @@ public:
 };
 
 // Writes a float so that reading it back as a float gives the same value, quickly (9 significant
-// digits at most, trailing zeros dropped). Returns the number of characters written (<= 24).
+// digits, trailing zeros dropped). Returns the number of characters written (<= 24).
 int formatFloat(float value, char* out);
 
 // Parses a JSON number at [begin, end): fast path for the short decimals that feature vectors

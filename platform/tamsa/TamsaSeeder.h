@@ -20,7 +20,7 @@ struct TamsaSeedOptions
     uint32_t locations = 10;
     uint32_t seed = 1;
     uint32_t firstTime = 1704067200; // 2024-01-01 00:00 UTC
-    uint32_t spanSeconds = 8 * 3600; // each location's objects spread over this window
+    uint32_t spanSeconds = 4 * 3600; // each location's objects spread over this window (busy cameras)
     uint32_t batchSize = 500;        // objects per camera answer
 };
 

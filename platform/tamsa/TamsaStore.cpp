@@ -5,6 +5,8 @@
 
 #include <sqlite3.h>
 
+#include <cstdlib>
+#include <cstring>
 #include <deque>
 #include <fcntl.h>
 #include <filesystem>
@@ -106,8 +108,15 @@ private:
 
 } // namespace
 
+static bool fullSyncWanted()
+{
+    const char* mode = std::getenv("TAMSA_SYNC");
+    return mode && std::strcmp(mode, "full") == 0;
+}
+
 TamsaStore::TamsaStore(std::string directory)
     : m_directory(std::move(directory))
+    , m_fullSync(fullSyncWanted())
 {}
 
 TamsaStore::~TamsaStore()
@@ -176,7 +185,7 @@ sqlite3* TamsaStore::connect(int32_t* status) const
         return nullptr;
     }
     sqlite3_busy_timeout(db, 30000);
-    exec(db, "PRAGMA synchronous=FULL");
+    exec(db, m_fullSync ? "PRAGMA synchronous=FULL" : "PRAGMA synchronous=NORMAL");
     exec(db, "PRAGMA temp_store=MEMORY");
     exec(db, "PRAGMA cache_size=-65536");
     *status = TAMSA_OK;
@@ -291,7 +300,7 @@ int32_t TamsaStore::ingest(sqlite3* db, int32_t groupId, uint32_t location, std:
     sqlite3_bind_int64(maxDuration.get(), 1, longest);
     const bool metaOk = sqlite3_step(maxDuration.get()) == SQLITE_DONE;
     // Vectors reach the disk before the commit that points at them.
-    if (!metaOk || !bodyFile->flush() || !faceFile->flush()) {
+    if (!metaOk || !bodyFile->flush(m_fullSync) || !faceFile->flush(m_fullSync)) {
         bodyFile->discard();
         faceFile->discard();
         rollback(db);

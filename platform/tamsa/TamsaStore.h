@@ -3,8 +3,13 @@
 // feature files (one writer each) and the read-only mappings the scans use. Handles find it by
 // path, so opening a handle per search (as the plug-in does) keeps the mappings warm.
 //
-// Files in the directory: tamsa.db (SQLite, WAL, synchronous FULL: a commit is on disk when it
-// returns), features/L<location>.<body|face>.f32 and .rows (see TamsaFeatureFile), tamsa.lock.
+// Files in the directory: tamsa.db (SQLite, WAL), features/L<location>.<body|face>.f32 and .rows
+// (see TamsaFeatureFile), tamsa.lock.
+//
+// Durability: an ingest returns after its data is written to the files (WAL, synchronous NORMAL),
+// so it survives a crash or kill of the process; a device sync per ingest costs tens of
+// milliseconds here and would cap the ingest rate far below what cameras deliver. With the
+// environment variable TAMSA_SYNC=full every ingest also syncs (survives a power loss).
 //
 // Thread use: every member function may be called from any thread. Ingests are serialised by
 // m_writeMutex in the process and by a lock on tamsa.lock between processes.
@@ -54,6 +59,7 @@ private:
     TamsaFeatureFile* writer(uint32_t location, FeatureKind kind); // REQUIRES: m_writeMutex held
 
     const std::string m_directory;
+    const bool m_fullSync;
     int m_lockFd = -1;
 
     std::mutex m_writeMutex;

@@ -30,7 +30,37 @@ bool parseHostOptions(const QStringList& args, HostOptions* options, QString* er
             *out = seconds;
             return true;
         };
-        if (arg == QLatin1String("--data")) {
+        auto takeCount = [&](quint64 maximum, quint64* out) {
+            QString text;
+            if (!takeValue(&text)) {
+                return false;
+            }
+            bool ok = false;
+            const quint64 count = text.toULongLong(&ok);
+            if (!ok || count > maximum) {
+                *error = QStringLiteral("%1 needs a whole number up to %2, not \"%3\"")
+                             .arg(arg)
+                             .arg(maximum)
+                             .arg(text);
+                return false;
+            }
+            *out = count;
+            return true;
+        };
+        quint64 count = 0;
+        if (arg == QLatin1String("--objects") || arg == QLatin1String("--locations") ||
+            arg == QLatin1String("--seed")) {
+            if (!takeCount(arg == QLatin1String("--objects") ? 100000000ull : 0xFFFFFFFFull, &count)) {
+                return false;
+            }
+            if (arg == QLatin1String("--objects")) {
+                options->objects = count;
+            } else if (arg == QLatin1String("--locations")) {
+                options->locations = quint32(count);
+            } else {
+                options->seed = quint32(count);
+            }
+        } else if (arg == QLatin1String("--data")) {
             if (!takeValue(&options->dataDir)) {
                 return false;
             }

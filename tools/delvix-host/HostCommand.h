@@ -13,9 +13,14 @@ struct HostOptions
     double waitSeconds = 2.0;
     double timeoutSeconds = 120.0;
     QStringList positional;
+    // seed: how many objects over how many locations, and the generator's seed
+    quint64 objects = 10000;
+    quint32 locations = 10;
+    quint32 seed = 1;
 };
 
-// Parses the options every subcommand shares (--data, --module, --wait, --timeout) and
+// Parses the options every subcommand shares (--data, --module, --wait, --timeout, and
+// --objects, --locations, --seed for seed) and
 // collects the rest as positional arguments. Returns false with a message on a bad option.
 bool parseHostOptions(const QStringList& args, HostOptions* options, QString* error);
 
@@ -27,3 +32,6 @@ bool parseJsonParameter(const QString& text, QVariant* value, QString* error);
 
 int runCall(const HostOptions& options);
 int runDemo(const HostOptions& options);
+int runSeed(const HostOptions& options);
+// cameras: takes --site FILE besides the shared options.
+int runCameras(QStringList args);

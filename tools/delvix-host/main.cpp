@@ -16,6 +16,8 @@ void printUsage(std::FILE* out)
                  "                        [--wait S] end after S s when no reply came (default 2)\n"
                  "                        [--timeout S] give up waiting for the final reply (default 120)\n"
                  "  demo                  load the plug-in and show what it does\n"
+                 "  cameras [--site FILE] start the configuration-server simulator on a site (default:\n"
+                 "                        a built-in one) and print the camera directory the plug-in learned\n"
                  "  --data DIR            the host's data folder (default ./delvix-data)\n");
 }
 
@@ -31,6 +33,9 @@ int main(int argc, char* argv[])
         return args.isEmpty() ? 2 : 0;
     }
     const QString subcommand = args.takeFirst();
+    if (subcommand == QLatin1String("cameras")) {
+        return runCameras(args);
+    }
     HostOptions options;
     QString error;
     if (!parseHostOptions(args, &options, &error)) {
@@ -48,6 +53,9 @@ int main(int argc, char* argv[])
             return 2;
         }
         return runDemo(options);
+    }
+    if (subcommand == QLatin1String("seed")) {
+        return runSeed(options);
     }
     std::fprintf(stderr, "delvix-host: unknown subcommand %s\n", qUtf8Printable(subcommand));
     printUsage(stderr);

@@ -60,6 +60,8 @@ TEST(TamsaJson, FloatsWrittenReadBackExactly)
     }
     EXPECT_EQ(std::string(buffer, tamsa::formatFloat(0.5f, buffer)), "0.5");
     EXPECT_EQ(std::string(buffer, tamsa::formatFloat(-12.0f, buffer)), "-12");
+    EXPECT_EQ(std::string(buffer, tamsa::formatFloat(0.125f, buffer)), "0.125");
+    EXPECT_EQ(std::string(buffer, tamsa::formatFloat(1e-7f, buffer)), "1.00000001e-7");
 }
 
 TEST(TamsaJson, NumbersParseLikeTheStandardLibrary)

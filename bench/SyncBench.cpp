@@ -7,8 +7,9 @@
 
 #include <QCoreApplication>
 #include <QDir>
-#include <QElapsedTimer>
+#include <QEventLoop>
 #include <QTemporaryDir>
+#include <QTimer>
 #include <benchmark/benchmark.h>
 
 #include <ctime>
@@ -24,15 +25,34 @@ double cpuSeconds(clockid_t clock)
     return double(ts.tv_sec) + double(ts.tv_nsec) * 1e-9;
 }
 
-bool waitFor(const std::function<bool()>& condition, int limitMs)
+// Waits in the event loop (sleeping, not spinning, so the wait costs no CPU) until poke() finds
+// the condition met, or the limit passes.
+class Waiter
 {
-    QElapsedTimer timer;
-    timer.start();
-    while (!condition() && timer.elapsed() < limitMs) {
-        QCoreApplication::processEvents(QEventLoop::AllEvents, 5);
+public:
+    bool wait(const std::function<bool()>& condition, int limitMs)
+    {
+        m_condition = condition;
+        if (!condition()) {
+            QEventLoop loop;
+            m_loop = &loop;
+            QTimer::singleShot(limitMs, &loop, &QEventLoop::quit);
+            loop.exec();
+            m_loop = nullptr;
+        }
+        return condition();
     }
-    return condition();
-}
+    void poke()
+    {
+        if (m_loop && m_condition()) {
+            m_loop->quit();
+        }
+    }
+
+private:
+    std::function<bool()> m_condition;
+    QEventLoop* m_loop = nullptr;
+};
 
 void BM_SyncPass200Cameras(benchmark::State& state)
 {
@@ -53,16 +73,24 @@ void BM_SyncPass200Cameras(benchmark::State& state)
     }
     auto proxy = std::make_shared<CameraProxy>(std::make_shared<BraskHttpClient>());
     CameraSynchronizer sync(proxy);
+    Waiter waiter;
     int tokens = 0, answers = 0, objects = 0, failures = 0;
-    QObject::connect(proxy.get(), &CameraProxy::receivePairToken, [&tokens] { ++tokens; });
-    QObject::connect(proxy.get(), &CameraProxy::requestFailed, [&failures] { ++failures; });
+    QObject::connect(proxy.get(), &CameraProxy::receivePairToken, [&] {
+        ++tokens;
+        waiter.poke();
+    });
+    QObject::connect(proxy.get(), &CameraProxy::requestFailed, [&] {
+        ++failures;
+        waiter.poke();
+    });
     QObject::connect(&sync, &CameraSynchronizer::receiveResponseData,
                      [&](const QVariantMap&, unsigned int, const QVariantMap& data) {
                          ++answers;
                          objects += data.value(QStringLiteral("count")).toInt();
+                         waiter.poke();
                      });
     sync.updateInformation(cameras.directoryMap());
-    if (!waitFor([&] { return tokens == kCameras / 10; }, 30000)) {
+    if (!waiter.wait([&] { return tokens == kCameras / 10; }, 30000)) {
         state.SkipWithError("pair tokens did not arrive");
         return;
     }
@@ -79,7 +107,7 @@ void BM_SyncPass200Cameras(benchmark::State& state)
         state.ResumeTiming();
 
         sync.synchronize();
-        if (!waitFor([&] { return answers + failures == kCameras; }, 60000)) {
+        if (!waiter.wait([&] { return answers + failures == kCameras; }, 60000)) {
             state.SkipWithError("not every camera answered");
             return;
         }

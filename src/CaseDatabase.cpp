@@ -7,14 +7,13 @@
 #include <QDir>
 #include <QJsonArray>
 #include <QJsonDocument>
-#include <QMutexLocker>
-#include <QRecursiveMutex>
 #include <QSqlDatabase>
 #include <QSqlError>
 #include <QSqlQuery>
 #include <QStringList>
 #include <QUuid>
 #include <algorithm>
+#include <mutex>
 
 namespace {
 
@@ -146,7 +145,9 @@ struct CaseDatabase::Shared
     const QString connectionName;
     // Held by every public operation for its whole length; guards the two members below and
     // the file's open state.
-    QRecursiveMutex mutex;
+    // A standard mutex rather than Qt's: ThreadSanitizer sees its locking and so can vouch for
+    // everything it guards.
+    std::recursive_mutex mutex;
     QSqlDatabase database;          // guarded by mutex; invalid when there is no file
     QMap<int, QVariantMap> caseMap; // guarded by mutex; one entry per row of "Case"
 };
@@ -190,7 +191,7 @@ CaseDatabase::CaseDatabase(const QString& path)
     : m_connectionName(QUuid::createUuid().toString())
     , m_shared(std::make_shared<Shared>(m_connectionName))
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     if (path.isEmpty()) {
         // Without the server's database path the folder would land at the root of the file
         // system (or SQLite would make a throw-away database): keep no file at all instead.
@@ -252,7 +253,7 @@ bool CaseDatabase::executeSql(QSqlQuery& query, const QString& statement, const 
 
 bool CaseDatabase::initialTable()
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     const QStringList tables = m_shared->database.tables(QSql::Tables);
     if (!tables.contains(CASE_TABLE, Qt::CaseSensitive)) {
@@ -275,7 +276,7 @@ bool CaseDatabase::initialTable()
 
 void CaseDatabase::initialCaseMap()
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_SELECT_CASES, {})) {
@@ -296,7 +297,7 @@ void CaseDatabase::initialCaseMap()
 
 int CaseDatabase::addCase(const QString& name, const QString& number, const QString& reporter)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     const qint64 createdTime = QDateTime::currentSecsSinceEpoch();
     QSqlQuery query(m_shared->database);
@@ -317,7 +318,7 @@ int CaseDatabase::addCase(const QString& name, const QString& number, const QStr
 
 int CaseDatabase::addCaseItem(int caseId, const QVariantMap& item)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     const QString faceImage = item.value(KEY_FACE_IMAGE).toString();
     const QString objectImage = item.value(KEY_OBJ_IMAGE).toString();
@@ -344,7 +345,7 @@ int CaseDatabase::addCaseItem(int caseId, const QVariantMap& item)
 
 bool CaseDatabase::updateCase(int caseId, const QVariantMap& fields)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     const QString name = fields.value(KEY_CASE_NAME).toString();
     const QString number = fields.value(KEY_CASE_NUMBER).toString();
@@ -375,7 +376,7 @@ bool CaseDatabase::updateCase(int caseId, const QVariantMap& fields)
 
 bool CaseDatabase::updateCaseItem(int itemId, const QVariantMap& fields)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_UPDATE_CASE_ITEM,
@@ -390,7 +391,7 @@ bool CaseDatabase::updateCaseItem(int itemId, const QVariantMap& fields)
 
 bool CaseDatabase::deleteCase(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_DELETE_CASE, {caseId})) {
@@ -402,7 +403,7 @@ bool CaseDatabase::deleteCase(int caseId)
 
 bool CaseDatabase::deleteCaseItem(int itemId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     return executeSql(query, SQL_DELETE_CASE_ITEM, {itemId});
@@ -410,13 +411,13 @@ bool CaseDatabase::deleteCaseItem(int itemId)
 
 bool CaseDatabase::containCase(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     return m_shared->caseMap.contains(caseId);
 }
 
 QVariantMap CaseDatabase::getCaseInfoMap(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     const auto entry = m_shared->caseMap.constFind(caseId);
     if (entry == m_shared->caseMap.constEnd()) {
         return {};
@@ -431,7 +432,7 @@ QVariantMap CaseDatabase::getCaseInfoMap(int caseId)
 
 QVariantList CaseDatabase::getCaseList()
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     QVariantList summaries;
     summaries.reserve(m_shared->caseMap.size());
     for (const QVariantMap& record : std::as_const(m_shared->caseMap)) {
@@ -449,7 +450,7 @@ QVariantList CaseDatabase::getCaseList()
 
 QVariantList CaseDatabase::getAllCase()
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     QVariantList records;
     records.reserve(m_shared->caseMap.size());
     for (const QVariantMap& record : std::as_const(m_shared->caseMap)) {
@@ -460,7 +461,7 @@ QVariantList CaseDatabase::getAllCase()
 
 QVariantList CaseDatabase::getCaseItemList(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_SELECT_CASE_ITEMS, {caseId})) {
@@ -478,7 +479,7 @@ QVariantList CaseDatabase::getCaseItemList(int caseId)
 
 QSet<int> CaseDatabase::getCaseItemIdSet(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_SELECT_CASE_ITEM_IDS, {caseId})) {
@@ -493,7 +494,7 @@ QSet<int> CaseDatabase::getCaseItemIdSet(int caseId)
 
 QVariantMap CaseDatabase::getCaseItemInfoMap(int itemId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_SELECT_CASE_ITEM, {itemId}) || !query.next()) {
@@ -504,7 +505,7 @@ QVariantMap CaseDatabase::getCaseItemInfoMap(int itemId)
 
 std::pair<QString, QString> CaseDatabase::getCaseDuration(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     if (!executeSql(query, SQL_SELECT_CASE_DURATION, {caseId}) || !query.next()) {
@@ -515,7 +516,7 @@ std::pair<QString, QString> CaseDatabase::getCaseDuration(int caseId)
 
 QList<QString> CaseDatabase::getCaseCoverImage(int caseId)
 {
-    QMutexLocker locker(&m_shared->mutex);
+    std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);
     ConnectionGuard guard(m_shared->database);
     QSqlQuery query(m_shared->database);
     const QString statement = SQL_SELECT_COVER_IMAGES.arg(SQL_COVER_FACE_IMAGES, SQL_COVER_OBJECT_IMAGES,

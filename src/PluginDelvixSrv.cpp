@@ -211,7 +211,7 @@ void PluginDelvixSrv::setCaseDatabase(std::shared_ptr<CaseDatabase> pCaseDatabas
 {
     std::shared_ptr<CaseDatabase> previous;
     {
-        QMutexLocker lock(&m_caseDatabaseMutex);
+        std::lock_guard<std::mutex> lock(m_caseDatabaseMutex);
         previous = std::move(m_pCaseDatabase);
         m_pCaseDatabase = std::move(pCaseDatabase);
     }
@@ -220,7 +220,7 @@ void PluginDelvixSrv::setCaseDatabase(std::shared_ptr<CaseDatabase> pCaseDatabas
 
 std::shared_ptr<CaseDatabase> PluginDelvixSrv::caseDatabase() const
 {
-    QMutexLocker lock(&m_caseDatabaseMutex);
+    std::lock_guard<std::mutex> lock(m_caseDatabaseMutex);
     return m_pCaseDatabase;
 }
 

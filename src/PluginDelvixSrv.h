@@ -179,7 +179,8 @@ private:
         PluginDelvixSrv* pPlugin = nullptr; // guarded by mutex; null once destruction began
     };
     std::shared_ptr<LifeGuard> m_pLifeGuard;
-    mutable QMutex m_caseDatabaseMutex;            // guards m_pCaseDatabase
+    // std::mutex rather than QMutex, here and in the vault: ThreadSanitizer sees its locking.
+    mutable std::mutex m_caseDatabaseMutex;        // guards m_pCaseDatabase
     std::shared_ptr<CaseDatabase> m_pCaseDatabase; // guarded by m_caseDatabaseMutex
     // Gates the two start commands; written by the settings slot, read on request threads.
     std::atomic<bool> m_bEnableDelvix{true};

@@ -15,6 +15,7 @@
 #include "ICameraInformationCollector.h"
 #include "PluginDelvixSrv.h"
 #include "Tamsa.h"
+#include "TamsaImplement.h"
 #include "TamsaSeeder.h"
 
 #include <QCoreApplication>
@@ -48,7 +49,8 @@ std::string hitThumbnails()
     std::string text = "{\"Thumbnail\":[{\"image\":\"" + image + "\",\"feature\":[";
     char number[32];
     for (int i = 0; i < 512; ++i) {
-        std::snprintf(number, sizeof number, "%s%.6f", i ? "," : "", value(random));
+        // Nine significant digits, as the store writes a float.
+        std::snprintf(number, sizeof number, "%s%.9g", i ? "," : "", double(float(value(random))));
         text += number;
     }
     return text + "]}]}";
@@ -290,6 +292,7 @@ void runSeeded(benchmark::State& state, const QString& command, const QVariantMa
     plugin.setCameraInformationCollector(QSharedPointer<FixedCollector>::create());
     plugin.InitialPluginBase(nullptr);
     int hits = 0;
+    const std::clock_t cpuStart = std::clock();
     for (auto _ : state) {
         ReplyWaiter waiter;
         plugin.Request(command, params, benchSender(), waiter.callback());
@@ -300,21 +303,63 @@ void runSeeded(benchmark::State& state, const QString& command, const QVariantMa
         }
     }
     state.counters["hits"] = hits;
+    // All threads of the process: the scheduler's, the pool's and the store's work.
+    state.counters["cpu_ms"] = double(std::clock() - cpuStart) * 1000.0 / CLOCKS_PER_SEC /
+                               double(std::max<benchmark::IterationCount>(1, state.iterations()));
+}
+
+// One location, a one-hour window in the middle of the seeded span, people of one gender.
+QVariantMap attributeSearch()
+{
+    const qint64 start = (qint64(g_seeded.options.firstTime) + g_seeded.options.spanSeconds / 2) * 1000;
+    return {{KEY_LOC_ID_LIST, QStringList{QStringLiteral("Loc7")}},
+            {KEY_START_TIMESTAMP, start},
+            {KEY_END_TIMESTAMP, start + 3600 * 1000},
+            {KEY_HUMAN_INFO, QStringLiteral(R"({"Gender":1})")}};
 }
 
 void BM_StartSearchSeeded(benchmark::State& state)
 {
-    // One location in five, people of one gender, over the whole seeded span.
-    QStringList locations;
-    for (uint32_t location = 1; location <= g_seeded.options.locations; location += 5) {
-        locations.append(QStringLiteral("Loc%1").arg(location));
+    runSeeded(state, CMD_START_SEARCH, attributeSearch(), kHits);
+}
+
+// The store's share of the same search: open, 201 records, close, without conversion or relay.
+void BM_StoreOnlySeeded(benchmark::State& state)
+{
+    AttributeQueryWorker worker;
+    const QVariantMap params = attributeSearch();
+    TamsaImplement tamsa;
+    int records = 0;
+    for (auto _ : state) {
+        void* database = nullptr;
+        void* search = nullptr;
+        records = 0;
+        if (worker.getObjectMetaInfoFirst(params, &database, &search) == 0) {
+            TTAMSA_OBJECTMETAINFO_RESULT result;
+            std::memset(&result, 0, sizeof result);
+            result.wSize = sizeof result;
+            while (records < kHits && tamsa.GetObjectMetaInfoNext(search, &result) == 0) {
+                ++records;
+            }
+            tamsa.GetObjectMetaInfoClose(search);
+        }
+        tamsa.releaseDatabase(&database);
     }
-    const qint64 start = qint64(g_seeded.options.firstTime) * 1000;
-    const QVariantMap params{{KEY_LOC_ID_LIST, locations},
-                             {KEY_START_TIMESTAMP, start},
-                             {KEY_END_TIMESTAMP, start + qint64(g_seeded.options.spanSeconds) * 1000},
-                             {KEY_HUMAN_INFO, QStringLiteral(R"({"Gender":1})")}};
-    runSeeded(state, CMD_START_SEARCH, params, kHits);
+    state.counters["hits"] = records;
+}
+
+// Opening and releasing one connection to the store, which every location of a
+// re-identification search pays.
+void BM_OpenStoreSeeded(benchmark::State& state)
+{
+    TamsaImplement tamsa;
+    for (auto _ : state) {
+        void* database = nullptr;
+        if (tamsa.initDatabase(&database) != 0) {
+            state.SkipWithError("cannot open the store");
+        }
+        tamsa.releaseDatabase(&database);
+    }
 }
 
 void BM_StartReIdSearchSeeded(benchmark::State& state)
@@ -361,6 +406,12 @@ int main(int argc, char** argv)
             return 1;
         }
         benchmark::RegisterBenchmark("BM_StartSearchSeeded", BM_StartSearchSeeded)
+            ->Unit(benchmark::kMillisecond)
+            ->UseRealTime();
+        benchmark::RegisterBenchmark("BM_StoreOnlySeeded", BM_StoreOnlySeeded)
+            ->Unit(benchmark::kMillisecond)
+            ->UseRealTime();
+        benchmark::RegisterBenchmark("BM_OpenStoreSeeded", BM_OpenStoreSeeded)
             ->Unit(benchmark::kMillisecond)
             ->UseRealTime();
         benchmark::RegisterBenchmark("BM_StartReIdSearchSeeded", BM_StartReIdSearchSeeded)

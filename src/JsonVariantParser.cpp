@@ -323,6 +323,44 @@ private:
         return powers[exponent];
     }
 
+    // Eight ASCII digits at once (little-endian load): feature vectors are long runs of
+    // numbers with many digits each.
+    static bool eightDigits(const char* p, uint64_t* value)
+    {
+        if constexpr (Q_BYTE_ORDER != Q_LITTLE_ENDIAN) {
+            return false;
+        }
+        uint64_t word;
+        std::memcpy(&word, p, sizeof word);
+        if ((((word & 0xF0F0F0F0F0F0F0F0ull) |
+              (((word + 0x0606060606060606ull) & 0xF0F0F0F0F0F0F0F0ull) >> 4)) != 0x3333333333333333ull)) {
+            return false;
+        }
+        word -= 0x3030303030303030ull;
+        word = (word * 10) + (word >> 8);
+        constexpr uint64_t mask = 0x000000FF000000FFull;
+        constexpr uint64_t mul1 = 0x000F424000000064ull; // 100 + (1000000 << 32)
+        constexpr uint64_t mul2 = 0x0000271000000001ull; // 1 + (10000 << 32)
+        *value = (((word & mask) * mul1) + (((word >> 16) & mask) * mul2)) >> 32;
+        return true;
+    }
+
+    // Appends the digits at m_p to mantissa (which wraps beyond 19 digits; the caller then
+    // does not use it) and returns how many there were.
+    int digitRun(uint64_t* mantissa)
+    {
+        const char* first = m_p;
+        uint64_t eight = 0;
+        while (m_end - m_p >= 8 && eightDigits(m_p, &eight)) {
+            *mantissa = *mantissa * 100000000ull + eight;
+            m_p += 8;
+        }
+        while (m_p != m_end && isDigit(*m_p)) {
+            *mantissa = *mantissa * 10 + uint64_t(*m_p++ - '0');
+        }
+        return int(m_p - first);
+    }
+
     struct Number
     {
         bool integer = false;
@@ -351,24 +389,17 @@ private:
             ++m_p;
             digits = 1;
         } else {
-            const char* first = m_p;
-            while (m_p != m_end && isDigit(*m_p)) {
-                mantissa = mantissa * 10 + uint64_t(*m_p++ - '0');
-            }
-            digits = int(m_p - first);
+            digits = digitRun(&mantissa);
         }
         if (m_p != m_end && *m_p == '.') {
             integral = false;
             ++m_p;
-            const char* first = m_p;
-            while (m_p != m_end && isDigit(*m_p)) {
-                mantissa = mantissa * 10 + uint64_t(*m_p++ - '0');
-            }
-            if (m_p == first) {
+            const int fraction = digitRun(&mantissa);
+            if (fraction == 0) {
                 return false;
             }
-            digits += int(m_p - first);
-            exponent = -int(m_p - first);
+            digits += fraction;
+            exponent = -fraction;
         }
         if (m_p != m_end && (*m_p == 'e' || *m_p == 'E')) {
             integral = false;

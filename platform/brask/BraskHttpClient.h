@@ -8,6 +8,7 @@
 #include <QObject>
 #include <QPointer>
 #include <QSslError>
+#include <atomic>
 #include <memory>
 
 class QAuthenticator;
@@ -75,7 +76,7 @@ private:
 
     Options m_options;
     QNetworkAccessManager* m_manager = nullptr; // child of this client
-    // Owner thread only, like everything below: Get from other threads is queued here first.
+    // Owner thread only: Get from other threads is queued over to that thread first.
     QHash<QNetworkReply*, Exchange> m_exchanges;
-    bool m_shuttingDown = false;
+    std::atomic<bool> m_shuttingDown{false}; // set by the destructor, read by Get on any thread
 };

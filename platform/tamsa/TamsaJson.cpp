@@ -508,10 +508,10 @@ int formatFloat(float value, char* out)
         *p++ = '0';
         return int(p - out);
     }
-    if (value < 0) {
-        *p++ = '-';
-        value = -value;
-    }
+    // Signs are random in feature vectors: no branch on them.
+    *p = '-';
+    p += value < 0 ? 1 : 0;
+    value = std::fabs(value);
     const double* pow10 = g_powers.values + 50;
     uint32_t bits = 0;
     std::memcpy(&bits, &value, sizeof bits);
@@ -542,12 +542,10 @@ int formatFloat(float value, char* out)
         --count;
     }
     if (k < 0 && k >= -5) {
-        *p++ = '0';
-        *p++ = '.';
-        for (int i = 0; i < -k - 1; ++i) {
-            *p++ = '0';
-        }
-        std::memcpy(p, text, size_t(count));
+        // Feature values live here: fixed-size copies, then the pointer moves by the real length.
+        std::memcpy(p, "0.000000", 8);
+        p += 1 - k;
+        std::memcpy(p, text, 9);
         return int(p + count - out);
     }
     if (k >= 0 && k < 9) {
@@ -679,20 +677,23 @@ void JsonValue::serializeTo(std::string* out) const
         return;
     case Type::Array:
         out->push_back('[');
-        if (numberArray) {
-            if (float32) {
-                out->reserve(out->size() + numbers.size() * 13 + 2);
+        if (numberArray && float32) {
+            // Written straight into the text: at most 24 characters and a comma per number.
+            const size_t start = out->size();
+            out->resize(start + numbers.size() * 25 + 1);
+            char* p = &(*out)[start];
+            for (size_t i = 0; i < numbers.size(); ++i) {
+                *p = ',';
+                p += i ? 1 : 0;
+                p += formatFloat(float(numbers[i]), p);
             }
-            char buffer[32];
+            out->resize(size_t(p - out->data()));
+        } else if (numberArray) {
             for (size_t i = 0; i < numbers.size(); ++i) {
                 if (i) {
                     out->push_back(',');
                 }
-                if (float32) {
-                    out->append(buffer, size_t(formatFloat(float(numbers[i]), buffer)));
-                } else {
-                    appendDouble(out, numbers[i]);
-                }
+                appendDouble(out, numbers[i]);
             }
         } else {
             for (size_t i = 0; i < items.size(); ++i) {

@@ -178,7 +178,7 @@ sqlite3* TamsaStore::connect(int32_t* status) const
 {
     sqlite3* db = nullptr;
     const std::string path = m_directory + "/tamsa.db";
-    if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_FULLMUTEX,
+    if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX,
                         nullptr) != SQLITE_OK) {
         sqlite3_close(db);
         *status = TAMSA_E_IO;

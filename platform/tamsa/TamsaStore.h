@@ -41,7 +41,8 @@ public:
     ~TamsaStore();
 
     const std::string& directory() const { return m_directory; }
-    // A new connection to the store's SQLite file; the caller closes it with sqlite3_close.
+    // A new connection to the store's SQLite file; the caller closes it with sqlite3_close and
+    // uses it from one thread at a time (it has no mutex of its own).
     sqlite3* connect(int32_t* status) const;
 
     // Stores a camera answer under `location`: the count stored or a negative status.

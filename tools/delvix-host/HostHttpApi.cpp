@@ -1,0 +1,200 @@
+#include "HostHttpApi.h"
+
+#include "HostCommand.h"
+#include "PluginHost.h"
+
+#include <QHttpServerRequest>
+#include <QJsonDocument>
+#include <QJsonObject>
+#include <QTcpSocket>
+#include <QTimer>
+#include <QUrlQuery>
+
+namespace {
+
+QByteArray reasonPhrase(int status)
+{
+    switch (status) {
+    case 200:
+        return "OK";
+    case 400:
+        return "Bad Request";
+    case 404:
+        return "Not Found";
+    case 405:
+        return "Method Not Allowed";
+    default:
+        return "Error";
+    }
+}
+
+void writeChunk(QTcpSocket* socket, const QByteArray& data)
+{
+    socket->write(QByteArray::number(data.size(), 16) + "\r\n" + data + "\r\n");
+}
+
+// Ends one streamed answer: the closing chunk, then the connection.
+void finishStream(QTcpSocket* socket)
+{
+    socket->write("0\r\n\r\n");
+    socket->disconnectFromHost();
+}
+
+} // namespace
+
+HostHttpApi::HostHttpApi(PluginHost* host, QObject* parent)
+    : QAbstractHttpServer(parent)
+    , m_host(host)
+{}
+
+bool HostHttpApi::listenOn(const QHostAddress& address, quint16 port, QString* error)
+{
+    if (!address.isLoopback()) {
+        *error = QStringLiteral("%1 is not a loopback address; the API listens on this machine only")
+                     .arg(address.toString());
+        return false;
+    }
+    m_port = listen(address, port);
+    if (m_port == 0) {
+        *error =
+            QStringLiteral("cannot listen on %1:%2 (is the port in use?)").arg(address.toString()).arg(port);
+        return false;
+    }
+    return true;
+}
+
+void HostHttpApi::writeSimple(QTcpSocket* socket, int status, const QByteArray& contentType,
+                              const QByteArray& body)
+{
+    socket->write("HTTP/1.1 " + QByteArray::number(status) + ' ' + reasonPhrase(status) +
+                  "\r\nContent-Type: " + contentType + "\r\nContent-Length: " +
+                  QByteArray::number(body.size()) + "\r\nConnection: close\r\n\r\n" + body);
+    socket->disconnectFromHost();
+}
+
+void HostHttpApi::missingHandler(const QHttpServerRequest&, QTcpSocket* socket)
+{
+    writeSimple(socket, 404, "text/plain", "not found\n");
+}
+
+bool HostHttpApi::handleRequest(const QHttpServerRequest& request, QTcpSocket* socket)
+{
+    const QString path = request.url().path();
+    if (path == QLatin1String("/health")) {
+        writeSimple(socket, 200, "application/json", "{\"ok\":true}\n");
+        return true;
+    }
+    if (request.method() != QHttpServerRequest::Method::Post) {
+        writeSimple(socket, 405, "text/plain", "use POST /request or POST /COMMAND\n");
+        return true;
+    }
+
+    QString command;
+    QVariant params;
+    QString client = QUrlQuery(request.url()).queryItemValue(QStringLiteral("client"));
+    if (client.isEmpty()) {
+        client = QString::fromUtf8(request.value("X-Client"));
+    }
+    double waitSeconds = 2.0;
+    const QByteArray body = request.body().trimmed();
+    if (path == QLatin1String("/request")) {
+        QJsonParseError parseError{};
+        const QJsonDocument document = QJsonDocument::fromJson(body, &parseError);
+        if (!document.isObject()) {
+            writeSimple(socket, 400, "text/plain",
+                        "the body must be a JSON object {\"command\", \"params\", \"client\", \"wait\"}: " +
+                            parseError.errorString().toUtf8() + '\n');
+            return true;
+        }
+        const QJsonObject envelope = document.object();
+        command = envelope.value(QStringLiteral("command")).toString();
+        params = envelope.value(QStringLiteral("params")).toVariant();
+        if (envelope.contains(QStringLiteral("client"))) {
+            client = envelope.value(QStringLiteral("client")).toString();
+        }
+        waitSeconds = envelope.value(QStringLiteral("wait")).toDouble(waitSeconds);
+    } else {
+        command = path.mid(1);
+        if (!body.isEmpty()) {
+            QString error;
+            if (!parseJsonParameter(QString::fromUtf8(body), &params, &error)) {
+                writeSimple(socket, 400, "text/plain", error.toUtf8() + '\n');
+                return true;
+            }
+        }
+    }
+    if (command.isEmpty()) {
+        writeSimple(socket, 400, "text/plain", "no command given\n");
+        return true;
+    }
+    dispatch(socket, command, params, client, qBound(0.0, waitSeconds, 3600.0));
+    return true;
+}
+
+void* HostHttpApi::senderHandle(const QString& client)
+{
+    std::shared_ptr<int>& handle = m_clients[client];
+    if (!handle) {
+        handle = std::make_shared<int>(int(m_clients.size()));
+    }
+    return handle.get();
+}
+
+void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVariant& params,
+                           const QString& client, double waitSeconds)
+{
+    ++m_requestsServed;
+    socket->write("HTTP/1.1 200 OK\r\nContent-Type: application/x-ndjson\r\nTransfer-Encoding: chunked\r\n"
+                  "Connection: close\r\n\r\n");
+
+    // State of this one answer, on the main thread; replies from any thread are queued to it.
+    struct Stream
+    {
+        QPointer<QTcpSocket> socket;
+        bool anyReply = false;
+        bool finished = false;
+    };
+    auto stream = std::make_shared<Stream>();
+    stream->socket = socket;
+    QPointer<HostHttpApi> self(this);
+
+    HDLR_DO_REQUEST_CB reply = [self, stream](bool bFinal, const QString& strCode, const QString& strMessage,
+                                              const QVariant& payload) {
+        const QByteArray line = replyLine(bFinal, strCode, strMessage, payload) + '\n';
+        if (!self) {
+            return;
+        }
+        QMetaObject::invokeMethod(
+            self.data(),
+            [stream, line, bFinal]() {
+                if (stream->finished) {
+                    return; // a reply after the final one has nowhere to go
+                }
+                stream->anyReply = true;
+                if (stream->socket) {
+                    writeChunk(stream->socket, line);
+                }
+                if (bFinal) {
+                    stream->finished = true;
+                    if (stream->socket) {
+                        finishStream(stream->socket);
+                    }
+                }
+            },
+            Qt::QueuedConnection);
+    };
+    QTimer::singleShot(qRound(waitSeconds * 1000), this, [stream]() {
+        if (!stream->anyReply && !stream->finished) {
+            stream->finished = true;
+            if (stream->socket) {
+                finishStream(stream->socket);
+            }
+        }
+    });
+
+    RequestSenderInfo sender;
+    sender.strSenderName = client;
+    sender.strSenderAddress = socket->peerAddress().toString();
+    sender.senderHandle = senderHandle(client);
+    m_host->request(command, params, sender, reply);
+}

@@ -1,0 +1,54 @@
+#pragma once
+// The local HTTP API of `delvix-host serve`: one request per HTTP POST, its replies streamed
+// back as JSON lines.
+//
+//   POST /request   body {"command": NAME, "params": VALUE, "client": NAME, "wait": SECONDS}
+//   POST /NAME      body VALUE (the parameter), client from ?client=NAME or the X-Client header
+//   GET  /health    {"ok": true}
+//
+// The answer is 200 with Content-Type application/x-ndjson in chunked transfer encoding: one
+// line {"final", "code", "message", "payload"} per reply, as it arrives; the body ends with the
+// final reply, or after "wait" seconds (default 2) when no reply at all has come (the stop
+// commands send none). A client name maps to one sender handle for the life of the server, so
+// a client's "stopSearch" stops that client's own search. Bad requests get 400 with a text.
+//
+// Threads: lives on the host's main thread; replies arriving on other threads are handed to it.
+// Listens on loopback addresses only.
+
+#include <QAbstractHttpServer>
+#include <QHash>
+#include <QHostAddress>
+#include <QPointer>
+#include <memory>
+
+class PluginHost;
+class QTcpSocket;
+
+class HostHttpApi : public QAbstractHttpServer
+{
+    Q_OBJECT
+public:
+    explicit HostHttpApi(PluginHost* host, QObject* parent = nullptr);
+
+    // False with a reason when the address is not a loopback one or the port is taken.
+    bool listenOn(const QHostAddress& address, quint16 port, QString* error);
+    quint16 port() const { return m_port; }
+    int requestsServed() const { return m_requestsServed; }
+
+protected:
+    bool handleRequest(const QHttpServerRequest& request, QTcpSocket* socket) override;
+    void missingHandler(const QHttpServerRequest& request, QTcpSocket* socket) override;
+
+private:
+    void dispatch(QTcpSocket* socket, const QString& command, const QVariant& params, const QString& client,
+                  double waitSeconds);
+    void* senderHandle(const QString& client);
+    static void writeSimple(QTcpSocket* socket, int status, const QByteArray& contentType,
+                            const QByteArray& body);
+
+    PluginHost* m_host; // borrowed; outlives this server
+    quint16 m_port = 0;
+    int m_requestsServed = 0;
+    // One stable address per client name; the address is the client's sender handle.
+    QHash<QString, std::shared_ptr<int>> m_clients;
+};

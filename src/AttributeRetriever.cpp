@@ -26,29 +26,31 @@ void answerCancelled(const AttributeRetriever::Callback& callback)
 } // namespace
 
 AttributeRetriever::AttributeRetriever()
-    : m_worker(std::make_shared<AttributeQueryWorker>())
-{}
+    : m_state(std::make_shared<State>())
+{
+    m_state->m_worker = std::make_shared<AttributeQueryWorker>();
+}
 
 AttributeRetriever::~AttributeRetriever()
 {
     std::deque<std::pair<QueryID, QueryArg>> cancelled;
     std::thread thread;
     {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        m_bShuttingDown = true;
-        cancelled.swap(m_tasks);
-        if (m_bThreadRunning && m_currentWorker) {
-            m_currentWorker->stop(m_currentGeneration);
+        std::lock_guard<std::mutex> lock(m_state->m_mutex);
+        m_state->m_bShuttingDown = true;
+        cancelled.swap(m_state->m_tasks);
+        if (m_state->m_bThreadRunning && m_state->m_currentWorker) {
+            m_state->m_currentWorker->stop(m_state->m_currentGeneration);
         }
-        thread = std::move(m_thread);
+        thread = std::move(m_state->m_thread);
     }
     for (const auto& task : cancelled) {
         answerCancelled(task.second.callback);
     }
     if (thread.joinable()) {
         if (thread.get_id() == std::this_thread::get_id()) {
-            // Destroyed from its own thread (a callback let go of the last owner): that thread
-            // touches nothing of the scheduler once this destructor has returned.
+            // Destroyed from one of its own callbacks: the thread cannot wait for itself. It
+            // holds the state and the worker it runs, finds the queue empty and ends.
             thread.detach();
         } else {
             thread.join();
@@ -61,38 +63,38 @@ void AttributeRetriever::setAttributeRetriever(std::shared_ptr<AttributeQueryWor
     if (!worker) {
         return;
     }
-    std::lock_guard<std::mutex> lock(m_mutex);
-    m_worker = std::move(worker);
+    std::lock_guard<std::mutex> lock(m_state->m_mutex);
+    m_state->m_worker = std::move(worker);
+}
+
+AttributeRetriever::QueryArg AttributeRetriever::makeArg(bool reIdSearch, const QVariantMap& params,
+                                                         const Callback& callback)
+{
+    std::shared_ptr<AttributeQueryWorker> worker;
+    {
+        std::lock_guard<std::mutex> lock(m_state->m_mutex);
+        worker = m_state->m_worker;
+    }
+    QueryArg arg;
+    if (reIdSearch) {
+        arg.method = [worker](const QVariantMap& p, const Callback& c) { worker->reId(p, c); };
+    } else {
+        arg.method = [worker](const QVariantMap& p, const Callback& c) { worker->query(p, c); };
+    }
+    arg.params = params;
+    arg.callback = callback;
+    arg.worker = std::move(worker);
+    return arg;
 }
 
 void AttributeRetriever::query(QueryID const& id, const QVariantMap& params, const Callback& callback)
 {
-    std::shared_ptr<AttributeQueryWorker> worker;
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        worker = m_worker;
-    }
-    QueryArg arg;
-    arg.method = [worker](const QVariantMap& p, const Callback& c) { worker->query(p, c); };
-    arg.params = params;
-    arg.callback = callback;
-    arg.worker = worker;
-    runTask(id, std::move(arg));
+    runTask(id, makeArg(false, params, callback));
 }
 
 void AttributeRetriever::reId(QueryID const& id, const QVariantMap& params, const Callback& callback)
 {
-    std::shared_ptr<AttributeQueryWorker> worker;
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        worker = m_worker;
-    }
-    QueryArg arg;
-    arg.method = [worker](const QVariantMap& p, const Callback& c) { worker->reId(p, c); };
-    arg.params = params;
-    arg.callback = callback;
-    arg.worker = worker;
-    runTask(id, std::move(arg));
+    runTask(id, makeArg(true, params, callback));
 }
 
 void AttributeRetriever::stop(QueryID const& id)
@@ -105,11 +107,11 @@ void AttributeRetriever::stop(QueryID const& id)
     {
         // Deciding and acting in one step: the task that is current when the stop is decided
         // is the one it reaches, and a finished search's stop is dropped by the worker.
-        std::lock_guard<std::mutex> lock(m_mutex);
-        if (m_bThreadRunning && m_currentQueryID == id && m_currentWorker) {
-            m_currentWorker->stop(m_currentGeneration);
+        std::lock_guard<std::mutex> lock(m_state->m_mutex);
+        if (m_state->m_bThreadRunning && m_state->m_currentQueryID == id && m_state->m_currentWorker) {
+            m_state->m_currentWorker->stop(m_state->m_currentGeneration);
         } else {
-            bCancelled = removeTask(id, &cancelled);
+            bCancelled = removeTask(*m_state, id, &cancelled);
         }
     }
     if (bCancelled) {
@@ -119,30 +121,30 @@ void AttributeRetriever::stop(QueryID const& id)
 
 bool AttributeRetriever::hasNextTask()
 {
-    std::lock_guard<std::mutex> lock(m_mutex);
-    return !m_tasks.empty();
+    std::lock_guard<std::mutex> lock(m_state->m_mutex);
+    return !m_state->m_tasks.empty();
 }
 
 void AttributeRetriever::runTask(QueryID const& id, QueryArg arg)
 {
-    std::unique_lock<std::mutex> lock(m_mutex);
-    if (m_bShuttingDown) {
+    std::unique_lock<std::mutex> lock(m_state->m_mutex);
+    if (m_state->m_bShuttingDown) {
         lock.unlock();
         answerCancelled(arg.callback);
         return;
     }
-    m_tasks.emplace_back(id, std::move(arg));
-    if (m_bThreadRunning) {
+    m_state->m_tasks.emplace_back(id, std::move(arg));
+    if (m_state->m_bThreadRunning) {
         return; // the running thread reaches the task
     }
     try {
-        manageThreadMode(std::thread(&AttributeRetriever::doQuery, this));
-        m_bThreadRunning = true;
+        manageThreadMode(std::thread(&AttributeRetriever::doQuery, m_state));
+        m_state->m_bThreadRunning = true;
     } catch (const std::system_error& e) {
         // Without a thread the task would wait forever: answer it now. The queue held only
         // this task, since no thread ran.
-        QueryArg failed = std::move(m_tasks.back().second);
-        m_tasks.pop_back();
+        QueryArg failed = std::move(m_state->m_tasks.back().second);
+        m_state->m_tasks.pop_back();
         lock.unlock();
         DELVIX_LOG(LogFacility::LevelError, "%s, thread start failed: %s", "AttributeRetriever::runTask",
                    e.what());
@@ -154,28 +156,29 @@ void AttributeRetriever::manageThreadMode(std::thread thread)
 {
     // The previous thread has left doQuery (it cleared m_bThreadRunning under the mutex and
     // touches nothing after it), so joining it here is immediate.
-    if (m_thread.joinable()) {
-        m_thread.join();
+    if (m_state->m_thread.joinable()) {
+        m_state->m_thread.join();
     }
-    m_thread = std::move(thread);
+    m_state->m_thread = std::move(thread);
 }
 
-std::pair<AttributeRetriever::QueryID, AttributeRetriever::QueryArg> AttributeRetriever::getNextTask()
+std::pair<AttributeRetriever::QueryID, AttributeRetriever::QueryArg>
+AttributeRetriever::getNextTask(State& state)
 {
-    if (m_tasks.empty()) {
+    if (state.m_tasks.empty()) {
         return {nullptr, QueryArg()};
     }
-    auto task = std::move(m_tasks.front());
-    m_tasks.pop_front();
+    auto task = std::move(state.m_tasks.front());
+    state.m_tasks.pop_front();
     return task;
 }
 
-bool AttributeRetriever::removeTask(QueryID const& id, QueryArg* removed)
+bool AttributeRetriever::removeTask(State& state, QueryID const& id, QueryArg* removed)
 {
-    for (auto it = m_tasks.begin(); it != m_tasks.end(); ++it) {
+    for (auto it = state.m_tasks.begin(); it != state.m_tasks.end(); ++it) {
         if (it->first == id) {
             *removed = std::move(it->second);
-            m_tasks.erase(it);
+            state.m_tasks.erase(it);
             return true;
         }
     }
@@ -184,35 +187,35 @@ bool AttributeRetriever::removeTask(QueryID const& id, QueryArg* removed)
 
 AttributeRetriever::QueryID AttributeRetriever::getCurrentQueryID()
 {
-    std::lock_guard<std::mutex> lock(m_mutex);
-    return m_currentQueryID;
+    std::lock_guard<std::mutex> lock(m_state->m_mutex);
+    return m_state->m_currentQueryID;
 }
 
-void AttributeRetriever::setCurrentQueryID(QueryID id)
+void AttributeRetriever::setCurrentQueryID(State& state, QueryID id)
 {
-    m_currentQueryID = id;
+    state.m_currentQueryID = id;
 }
 
-void AttributeRetriever::doQuery()
+void AttributeRetriever::doQuery(const std::shared_ptr<State>& state)
 {
     for (;;) {
         QueryArg arg;
         {
-            std::lock_guard<std::mutex> lock(m_mutex);
-            if (m_tasks.empty()) {
+            std::lock_guard<std::mutex> lock(state->m_mutex);
+            if (state->m_tasks.empty()) {
                 // Testing for work and leaving are one step, so no task is left behind.
-                setCurrentQueryID(nullptr);
-                m_currentWorker.reset();
-                m_bThreadRunning = false;
+                setCurrentQueryID(*state, nullptr);
+                state->m_currentWorker.reset();
+                state->m_bThreadRunning = false;
                 return;
             }
-            auto task = getNextTask();
+            auto task = getNextTask(*state);
             arg = std::move(task.second);
-            setCurrentQueryID(task.first);
-            m_currentWorker = arg.worker;
+            setCurrentQueryID(*state, task.first);
+            state->m_currentWorker = arg.worker;
             // The worker runs one search at a time and the previous one has returned, so
             // this is the generation the task's search will run as.
-            m_currentGeneration = arg.worker ? arg.worker->searchGeneration() : 0;
+            state->m_currentGeneration = arg.worker ? arg.worker->searchGeneration() : 0;
         }
         try {
             if (arg.method) {

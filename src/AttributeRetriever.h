@@ -53,25 +53,34 @@ public:
     void setAttributeRetriever(std::shared_ptr<AttributeQueryWorker> worker);
 
 private:
-    void runTask(QueryID const& id, QueryArg arg);
-    std::pair<QueryID, QueryArg> getNextTask(); // REQUIRES: m_mutex held
-    // Takes the oldest queued task of id out of the queue; false when there is none.
-    bool removeTask(QueryID const& id, QueryArg* removed); // REQUIRES: m_mutex held
-    void doQuery();
-    QueryID getCurrentQueryID();
-    void setCurrentQueryID(QueryID id);        // REQUIRES: m_mutex held
-    void manageThreadMode(std::thread thread); // REQUIRES: m_mutex held
+    // Everything the scheduler thread uses. The thread holds it too, so that a scheduler
+    // destroyed from inside one of its own callbacks leaves the thread valid state to find
+    // the queue empty and end on.
+    struct State
+    {
+        std::mutex m_mutex;
+        std::deque<std::pair<QueryID, QueryArg>> m_tasks; // guarded by m_mutex; front = oldest
+        QueryID m_currentQueryID = nullptr;               // guarded by m_mutex
+        // Whether the scheduler thread runs. Kept apart from the identifier: a task may carry
+        // a null identifier, and that must not start a second thread beside the first.
+        bool m_bThreadRunning = false; // guarded by m_mutex
+        bool m_bShuttingDown = false;  // guarded by m_mutex
+        // The running task's worker and search generation, for its stop.
+        std::shared_ptr<AttributeQueryWorker> m_currentWorker; // guarded by m_mutex
+        quint64 m_currentGeneration = 0;                       // guarded by m_mutex
+        std::shared_ptr<AttributeQueryWorker> m_worker;        // guarded by m_mutex
+        std::thread m_thread;                                  // guarded by m_mutex
+    };
 
-    std::mutex m_mutex;
-    std::deque<std::pair<QueryID, QueryArg>> m_tasks; // guarded by m_mutex; front = oldest
-    QueryID m_currentQueryID = nullptr;               // guarded by m_mutex
-    // Whether the scheduler thread runs. Kept apart from the identifier: a task may carry a
-    // null identifier, and that must not start a second thread beside the first.
-    bool m_bThreadRunning = false; // guarded by m_mutex
-    bool m_bShuttingDown = false;  // guarded by m_mutex
-    // The running task's worker and search generation, for its stop.
-    std::shared_ptr<AttributeQueryWorker> m_currentWorker; // guarded by m_mutex
-    quint64 m_currentGeneration = 0;                       // guarded by m_mutex
-    std::shared_ptr<AttributeQueryWorker> m_worker;        // guarded by m_mutex
-    std::thread m_thread;                                  // guarded by m_mutex
+    void runTask(QueryID const& id, QueryArg arg);
+    static std::pair<QueryID, QueryArg> getNextTask(State& state); // REQUIRES: state.m_mutex held
+    // Takes the oldest queued task of id out of the queue; false when there is none.
+    static bool removeTask(State& state, QueryID const& id, QueryArg* removed); // REQUIRES: m_mutex held
+    static void doQuery(const std::shared_ptr<State>& state);
+    QueryID getCurrentQueryID();
+    static void setCurrentQueryID(State& state, QueryID id); // REQUIRES: state.m_mutex held
+    void manageThreadMode(std::thread thread);               // REQUIRES: m_state->m_mutex held
+    QueryArg makeArg(bool reIdSearch, const QVariantMap& params, const Callback& callback);
+
+    const std::shared_ptr<State> m_state;
 };

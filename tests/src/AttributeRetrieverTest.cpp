@@ -230,3 +230,32 @@ TEST_F(RetrieverTest, DestructionCancelsQueuedStopsRunningAndWaits)
     std::this_thread::sleep_for(std::chrono::milliseconds(20));
     EXPECT_EQ(running.calls().size(), calls);
 }
+
+TEST_F(RetrieverTest, DestroyedFromItsOwnCallback)
+{
+    // The last owner lets go inside a search's final call, on the scheduler's own thread.
+    useStore(slowStore(3, 0));
+    AttributeRetriever* scheduler = retriever.release();
+    Gate firstHit;
+    Gate proceed;
+    SearchRecorder first;
+    first.onCall = [&, scheduler](bool finished, const QVariantMap&) {
+        if (!finished) {
+            firstHit.open();
+            proceed.wait();
+        } else {
+            delete scheduler;
+        }
+    };
+    SearchRecorder queued;
+    scheduler->query(kClientA, request(), first.callback());
+    ASSERT_TRUE(firstHit.wait());
+    scheduler->query(kClientB, request(), queued.callback());
+    proceed.open();
+    EXPECT_TRUE(first.waitFinished());
+    EXPECT_TRUE(queued.waitFinished());
+    EXPECT_TRUE(queued.endsWithOneEmptyFinal());
+    EXPECT_TRUE(queued.hits().empty());
+    EXPECT_EQ(first.hits().size(), 3u);
+    EXPECT_EQ(store->firstCount(), 1);
+}

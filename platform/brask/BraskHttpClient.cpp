@@ -141,6 +141,15 @@ void BraskHttpClient::start(const Call& call, const std::shared_ptr<CompletionOn
         exchange.timer->start(int(qMin<unsigned int>(call.timeoutMs, unsigned(INT_MAX))));
     }
     m_exchanges.insert(reply, exchange);
+    if (m_options.maxBodyBytes > 0) {
+        connect(reply, &QNetworkReply::downloadProgress, this, [this, reply](qint64 received, qint64 total) {
+            auto it = m_exchanges.find(reply);
+            if (it != m_exchanges.end() && !it->tooLarge && qMax(received, total) > m_options.maxBodyBytes) {
+                it->tooLarge = true;
+                reply->abort();
+            }
+        });
+    }
 }
 
 void BraskHttpClient::onFinished(QNetworkReply* reply)
@@ -162,10 +171,16 @@ void BraskHttpClient::onFinished(QNetworkReply* reply)
     for (const auto& pair : reply->rawHeaderPairs()) {
         headers += pair.first + ": " + pair.second + "\r\n";
     }
-    const QByteArray body = reply->readAll();
-    const QNetworkReply::NetworkError error =
-        exchange.timedOut ? QNetworkReply::TimeoutError : reply->error();
-    exchange.completion->call(error, headers, body, exchange.timedOut);
+    QNetworkReply::NetworkError error = reply->error();
+    QByteArray body;
+    if (exchange.timedOut) {
+        error = QNetworkReply::TimeoutError;
+    } else if (exchange.tooLarge) {
+        error = QNetworkReply::UnknownContentError;
+    } else {
+        body = reply->readAll();
+    }
+    exchange.completion->call(error, headers, body, exchange.timedOut || exchange.tooLarge);
 }
 
 void BraskHttpClient::onAuthenticationRequired(QNetworkReply* reply, QAuthenticator* authenticator)

@@ -27,6 +27,9 @@ public:
         // certificate errors are ignored for hosts given as loopback, private-use or link-local
         // addresses (and "localhost"); every other host is verified normally.
         bool acceptSelfSignedOnLocalNetwork = true;
+        // A body larger than this ends the exchange with UnknownContentError (abandoned), so a
+        // misbehaving peer cannot fill the plug-in's memory. 0: no limit.
+        qint64 maxBodyBytes = 256 * 1024 * 1024;
     };
 
     BraskHttpClient();
@@ -55,6 +58,7 @@ private:
         QString host;
         bool authAnswered = false;
         bool timedOut = false;
+        bool tooLarge = false;
         QTimer* timer = nullptr; // child of this client, deleted with the exchange
     };
     struct Call

@@ -204,6 +204,17 @@ TEST_F(BraskHttpClientTest, RefusedTimedOutAndInvalidCallsStillCompleteOnce)
     EXPECT_EQ(invalid->calls, 1);
 }
 
+TEST_F(BraskHttpClientTest, OversizedBodyIsRefused)
+{
+    BraskHttpClient::Options small;
+    small.maxBodyBytes = 1000; // a window of objects is far larger
+    BraskHttpClient client(small);
+    auto outcome = fetch(client, "basic", window());
+    EXPECT_EQ(outcome->error, QNetworkReply::UnknownContentError);
+    EXPECT_TRUE(outcome->abandoned);
+    EXPECT_TRUE(outcome->body.isEmpty());
+}
+
 TEST_F(BraskHttpClientTest, DestroyingTheClientCompletesEveryOutstandingCall)
 {
     m_cameras.setSlow("basic", 2000);

@@ -63,9 +63,9 @@ bool readTrajectory(const JsonValue* value, std::vector<TrajectoryPoint>* out)
     return true;
 }
 
-// Takes the "feature" of the first element of a thumbnail array into `vector` and leaves null in
-// its place. A missing array, element or feature is fine; a malformed feature is not.
-bool takeFeature(JsonValue* thumbnails, std::vector<float>* vector)
+// Takes the "feature" of the first element of a thumbnail array into `vector` and leaves the
+// marker in its place. A missing array, element or feature is fine; a malformed feature is not.
+bool takeFeature(JsonValue* thumbnails, std::vector<float>* vector, char marker)
 {
     if (!thumbnails) {
         return true;
@@ -92,6 +92,7 @@ bool takeFeature(JsonValue* thumbnails, std::vector<float>* vector)
         (*vector)[i] = float(number);
     }
     *feature = JsonValue();
+    feature->marker = marker;
     return true;
 }
 
@@ -134,8 +135,8 @@ bool TamsaCameraObject::fromJson(const JsonValue& element, TamsaCameraObject* ou
             thumbnails.setMember(name, *crops);
         }
     }
-    if (!takeFeature(thumbnails.member("Thumbnail"), &out->m_body) ||
-        !takeFeature(thumbnails.member("FaceThumbnail"), &out->m_face)) {
+    if (!takeFeature(thumbnails.member("Thumbnail"), &out->m_body, kBodyMarker) ||
+        !takeFeature(thumbnails.member("FaceThumbnail"), &out->m_face, kFaceMarker)) {
         return false;
     }
 

@@ -1,7 +1,9 @@
 #pragma once
 // One element of a camera answer ({"ObjectMetaInfo": [element, ...]}), checked and reduced to
-// what the store keeps: the first body and face vectors leave the texts (their "feature" member
-// becomes null) and are kept as float32; everything else is kept as the camera sent it.
+// what the store keeps: the first body and face vectors leave the texts and are kept as float32;
+// everything else is kept as the camera sent it. In the stored thumbnail text the value of the
+// moved "feature" members is a single marker character (kBodyMarker, kFaceMarker), replaced by
+// the vector's text (or null) when a search hands the object out.
 
 #include "TamsaJson.h"
 #include "TamsaQuery.h"
@@ -11,6 +13,9 @@
 #include <vector>
 
 namespace tamsa {
+
+constexpr char kBodyMarker = '\x01';
+constexpr char kFaceMarker = '\x02';
 
 class TamsaCameraObject
 {

@@ -578,6 +578,22 @@ int formatFloat(float value, char* out)
     return int(p - out);
 }
 
+void appendFloatArray(std::string* out, const float* values, size_t count)
+{
+    // Written straight into the text: at most 24 characters and a comma per number.
+    const size_t start = out->size();
+    out->resize(start + count * 25 + 2);
+    char* p = &(*out)[start];
+    *p++ = '[';
+    for (size_t i = 0; i < count; ++i) {
+        *p = ',';
+        p += i ? 1 : 0;
+        p += formatFloat(values[i], p);
+    }
+    *p++ = ']';
+    out->resize(size_t(p - out->data()));
+}
+
 JsonValue JsonValue::arrayElement(size_t i) const
 {
     if (numberArray) {
@@ -660,7 +676,11 @@ void JsonValue::serializeTo(std::string* out) const
 {
     switch (type) {
     case Type::Null:
-        out->append("null");
+        if (marker) {
+            out->push_back(marker);
+        } else {
+            out->append("null");
+        }
         return;
     case Type::Bool:
         out->append(boolean ? "true" : "false");

@@ -36,6 +36,9 @@ public:
     bool numberArray = false;
     // A float32 vector handed out by the store: written with float precision, not double.
     bool float32 = false;
+    // Null only: written as this single control character instead of "null". Real texts never
+    // hold one unescaped, so the store uses it to mark where a vector goes back in.
+    char marker = 0;
     std::vector<double> numbers;
     std::vector<JsonValue> items;
     // Object members in their order (parallel vectors).
@@ -70,6 +73,9 @@ public:
 // Writes a float so that reading it back as a float gives the same value, quickly (9 significant
 // digits, trailing zeros dropped). Returns the number of characters written (<= 24).
 int formatFloat(float value, char* out);
+
+// Appends [v0,v1,...] written with formatFloat.
+void appendFloatArray(std::string* out, const float* values, size_t count);
 
 // Parses a JSON number at [begin, end): fast path for the short decimals that feature vectors
 // use, exact fallback otherwise. Returns the end of the number or null when it is not one.

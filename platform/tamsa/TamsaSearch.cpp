@@ -1,5 +1,6 @@
 #include "TamsaSearch.h"
 
+#include "TamsaCameraObject.h"
 #include "TamsaCosine.h"
 
 #include <sqlite3.h>
@@ -455,26 +456,31 @@ void TamsaSearch::fill(sqlite3_stmt* s, float score, float faceScore, TTAMSA_OBJ
     const size_t blobBytes = size_t(sqlite3_column_bytes(s, ColTrajectory));
     m_trajectory.assign(blob, blob ? blob + blobBytes / sizeof(double) : blob);
 
-    // Vectors live in the feature files; they become text only here, for the records handed out.
-    JsonValue thumbnails;
-    if (!JsonValue::parse(columnText(s, ColThumbnails), &thumbnails) || !thumbnails.isObject()) {
-        thumbnails = JsonValue();
-        thumbnails.type = JsonValue::Type::Object;
-    }
-    const std::pair<const char*, int> crops[] = {{"Thumbnail", ColBodyRow}, {"FaceThumbnail", ColFaceRow}};
-    for (const auto& crop : crops) {
-        JsonValue* array = thumbnails.member(crop.first);
-        if (!array || !array->isArray() || array->items.empty() || !array->items[0].isObject() ||
-            sqlite3_column_type(s, crop.second) == SQLITE_NULL) {
+    // Vectors live in the feature files; they become text only here, for the records handed out,
+    // spliced in where the stored text holds their marker.
+    const std::string_view stored = columnText(s, ColThumbnails);
+    m_thumbnails.clear();
+    m_thumbnails.reserve(stored.size() + 2 * 512 * 13);
+    size_t from = 0;
+    for (size_t at = 0; at < stored.size(); ++at) {
+        const char c = stored[at];
+        if (c != kBodyMarker && c != kFaceMarker) {
             continue;
         }
-        const FeatureKind kind = crop.second == ColBodyRow ? FeatureKind::Body : FeatureKind::Face;
-        if (const float* vector = vectorOf(location, kind, sqlite3_column_int64(s, crop.second))) {
-            array->items[0].setMember("feature", JsonValue::makeFloatArray(vector, kFeatureDim));
+        m_thumbnails.append(stored, from, at - from);
+        from = at + 1;
+        const int rowColumn = c == kBodyMarker ? ColBodyRow : ColFaceRow;
+        const FeatureKind kind = c == kBodyMarker ? FeatureKind::Body : FeatureKind::Face;
+        const float* vector = sqlite3_column_type(s, rowColumn) == SQLITE_NULL
+                                  ? nullptr
+                                  : vectorOf(location, kind, sqlite3_column_int64(s, rowColumn));
+        if (vector) {
+            appendFloatArray(&m_thumbnails, vector, kFeatureDim);
+        } else {
+            m_thumbnails.append("null"); // a row lost with a power failure (see TamsaStore)
         }
     }
-    m_thumbnails.clear();
-    thumbnails.serializeTo(&m_thumbnails);
+    m_thumbnails.append(stored, from, std::string_view::npos);
 
     std::memset(reinterpret_cast<char*>(result) + 2, 0, sizeof(*result) - 2);
     result->qwObjectId = uint64_t(sqlite3_column_int64(s, ColObjectId));

@@ -235,6 +235,13 @@ TEST_F(RetrieverTest, DestroyedFromItsOwnCallback)
 {
     // The last owner lets go inside a search's final call, on the scheduler's own thread.
     useStore(slowStore(3, 0));
+    std::weak_ptr<AttributeQueryWorker> worker;
+    {
+        auto owned = std::make_shared<AttributeQueryWorker>();
+        owned->setTamsa(store);
+        retriever->setAttributeRetriever(owned);
+        worker = owned;
+    }
     AttributeRetriever* scheduler = retriever.release();
     Gate firstHit;
     Gate proceed;
@@ -258,4 +265,9 @@ TEST_F(RetrieverTest, DestroyedFromItsOwnCallback)
     EXPECT_TRUE(queued.hits().empty());
     EXPECT_EQ(first.hits().size(), 3u);
     EXPECT_EQ(store->firstCount(), 1);
+    // The thread lets go of the worker on its way out; wait for that before the test ends.
+    for (int i = 0; i < 5000 && !worker.expired(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    EXPECT_TRUE(worker.expired());
 }

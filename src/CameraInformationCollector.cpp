@@ -82,10 +82,16 @@ QByteArray escapeXmlText(const QByteArray& text)
 } // namespace
 
 CameraInformationCollector::CameraInformationCollector(IFrameworkTools* tools)
-    : m_tunnelControl(new NOVIRSrvTunnelControl(tools ? tools->GetNovirTunnelClient() : nullptr))
 {
-    handleCameraInformationChange();
-    handleLocationInformationChange();
+    // Created here, with every member in place, and its signals connected before it registers
+    // with the client: the client may answer on its own thread at once (or a hasty one from
+    // inside the registration), and an answer announced to no receiver would leave the
+    // directory empty until the next change.
+    m_tunnelControl.reset(new NOVIRSrvTunnelControl(tools ? tools->GetNovirTunnelClient() : nullptr,
+                                                    [this](NOVIRSrvTunnelControl* control) {
+                                                        handleCameraInformationChange(control);
+                                                        handleLocationInformationChange(control);
+                                                    }));
 }
 
 CameraInformationCollector::~CameraInformationCollector() = default;
@@ -95,9 +101,8 @@ QSharedPointer<NOVIRSrvTunnelControl> CameraInformationCollector::getNOVIRSrvTun
     return m_tunnelControl;
 }
 
-void CameraInformationCollector::handleCameraInformationChange()
+void CameraInformationCollector::handleCameraInformationChange(NOVIRSrvTunnelControl* control)
 {
-    NOVIRSrvTunnelControl* control = m_tunnelControl.data();
     connect(control, &NOVIRSrvTunnelControl::updateCameras, this, &CameraInformationCollector::updateCameras);
     connect(control, &NOVIRSrvTunnelControl::removeCamera, this, &CameraInformationCollector::removeCamera);
     connect(control, &NOVIRSrvTunnelControl::updateCamera, this, &CameraInformationCollector::updateCamera);
@@ -105,9 +110,8 @@ void CameraInformationCollector::handleCameraInformationChange()
             &CameraInformationCollector::updateCameraStatus);
 }
 
-void CameraInformationCollector::handleLocationInformationChange()
+void CameraInformationCollector::handleLocationInformationChange(NOVIRSrvTunnelControl* control)
 {
-    NOVIRSrvTunnelControl* control = m_tunnelControl.data();
     connect(control, &NOVIRSrvTunnelControl::updateLocations, this,
             &CameraInformationCollector::queryLocations);
     connect(control, &NOVIRSrvTunnelControl::addLocation, this, &CameraInformationCollector::addLocation);

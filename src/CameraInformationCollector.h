@@ -45,8 +45,8 @@ private slots:
     void removeLocation(const QString& name);
 
 private:
-    void handleCameraInformationChange();
-    void handleLocationInformationChange();
+    void handleCameraInformationChange(NOVIRSrvTunnelControl* control);
+    void handleLocationInformationChange(NOVIRSrvTunnelControl* control);
     void updateSingleCameraInformation(const QString& name);
     void updateAllCamerasInformation();
     void emitCameraInformationChanged();

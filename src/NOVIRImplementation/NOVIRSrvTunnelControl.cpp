@@ -58,11 +58,19 @@ void NOVIRSrvTunnelControl::callGuarded(const std::shared_ptr<CallbackGuard>& gu
 }
 
 NOVIRSrvTunnelControl::NOVIRSrvTunnelControl(INovirTunnelClient* client)
+    : NOVIRSrvTunnelControl(client, {})
+{}
+
+NOVIRSrvTunnelControl::NOVIRSrvTunnelControl(
+    INovirTunnelClient* client, const std::function<void(NOVIRSrvTunnelControl*)>& connectSignals)
     : QObject(nullptr)
     , m_pNovirTunnelClient(client)
     , m_guard(std::make_shared<CallbackGuard>())
 {
     m_guard->m_pReceiver = this;
+    if (connectSignals) {
+        connectSignals(this);
+    }
     if (!m_pNovirTunnelClient) {
         return;
     }

@@ -17,6 +17,7 @@
 #include <QReadWriteLock>
 #include <QString>
 #include <QVariant>
+#include <functional>
 #include <memory>
 
 class NOVIRSrvTunnelControl : public QObject
@@ -24,6 +25,12 @@ class NOVIRSrvTunnelControl : public QObject
     Q_OBJECT
 public:
     explicit NOVIRSrvTunnelControl(INovirTunnelClient* client);
+    // As above, but connectSignals is called with the new object before any handler is
+    // registered. The client may call a handler on its own thread at once, and a signal emitted
+    // before its receivers are connected is lost; receivers that must see the first answers
+    // connect here.
+    NOVIRSrvTunnelControl(INovirTunnelClient* client,
+                          const std::function<void(NOVIRSrvTunnelControl*)>& connectSignals);
     ~NOVIRSrvTunnelControl() override;
 
     bool sendRequest(void* clientID, const QString& cmdName, const QString& content, const QString& extra,

@@ -314,6 +314,34 @@ TEST_F(CollectorTest, WriteDataKeepsTextSafeAndIntact)
     EXPECT_EQ(client.requests.size(), before + 1);
 }
 
+TEST(CollectorWithHastyClient, AnswersArrivingDuringConstructionAreNotLost)
+{
+    ScriptedTunnelClient client;
+    client.connectOnRegister = true;
+    client.onInsert = [&client](int index) {
+        const QString cmd = client.requests.at(index).cmdName;
+        if (cmd == QLatin1String("GetNodeInfo")) {
+            client.answer(index, true, QStringLiteral("0"),
+                          QStringLiteral("<NodeInfo><Cameras><Cam><Name>A</Name><ObjectMetaRecordCap>true"
+                                         "</ObjectMetaRecordCap></Cam></Cameras></NodeInfo>"));
+        } else if (cmd == QLatin1String("QryLocs")) {
+            client.answer(
+                index, true, QStringLiteral("0"),
+                QStringLiteral("<LocRecs><LocList><Live>true</Live><Loc><Alias>A</Alias><Name>Loc1</Name>"
+                               "<GrpID>1</GrpID></Loc></LocList></LocRecs>"));
+        } else if (cmd == QLatin1String("SubCamStatus")) {
+            client.statusEvent(
+                client.serverId, QString(),
+                QStringLiteral("<CamStatus><Cam><Name>A</Name><ConnState>Connected</ConnState></Cam>"
+                               "</CamStatus>"));
+        }
+    };
+    FakeTools tools(&client);
+    CameraInformationCollector collector(&tools);
+    EXPECT_EQ(collector.cameraDirectory().keys(), QStringList{QStringLiteral("A")});
+    EXPECT_EQ(collector.getCameraNodeID(QStringLiteral("Loc1")), QStringLiteral("A"));
+}
+
 TEST(CollectorWithoutClient, WorksWithoutTunnelClient)
 {
     CameraInformationCollector collector(nullptr);

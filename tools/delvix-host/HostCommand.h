@@ -33,3 +33,5 @@ bool parseJsonParameter(const QString& text, QVariant* value, QString* error);
 int runCall(const HostOptions& options);
 int runDemo(const HostOptions& options);
 int runSeed(const HostOptions& options);
+// cameras: takes --site FILE besides the shared options.
+int runCameras(QStringList args);

@@ -16,6 +16,8 @@ void printUsage(std::FILE* out)
                  "                        [--wait S] end after S s when no reply came (default 2)\n"
                  "                        [--timeout S] give up waiting for the final reply (default 120)\n"
                  "  demo                  load the plug-in and show what it does\n"
+                 "  cameras [--site FILE] start the configuration-server simulator on a site (default:\n"
+                 "                        a built-in one) and print the camera directory the plug-in learned\n"
                  "  seed                  fill the data folder's store (DIR/Server) with synthetic objects\n"
                  "                        [--objects N] (default 10000) [--locations L] (default 10)\n"
                  "                        [--seed S] (default 1)\n"
@@ -34,6 +36,9 @@ int main(int argc, char* argv[])
         return args.isEmpty() ? 2 : 0;
     }
     const QString subcommand = args.takeFirst();
+    if (subcommand == QLatin1String("cameras")) {
+        return runCameras(args);
+    }
     HostOptions options;
     QString error;
     if (!parseHostOptions(args, &options, &error)) {

@@ -6,6 +6,7 @@
 
 #include <QList>
 #include <QString>
+#include <functional>
 
 class ScriptedTunnelClient : public INovirTunnelClient
 {
@@ -29,6 +30,10 @@ public:
     };
 
     bool accept = true; // what insertRequest and insertSubscribeRequest answer
+    // The hastiest client possible: servers already up are reported from inside the
+    // registration, and onInsert may answer a request from inside the call that sent it.
+    bool connectOnRegister = false;
+    std::function<void(int requestIndex)> onInsert;
     QString serverId = QStringLiteral("srv-1");
     QList<Request> requests;
     QList<Registration> connectRegistrations;
@@ -109,6 +114,9 @@ public:
                        const QString& cmdName, const NSNovirTunnelClient::RequestInfo& request) override
     {
         requests.append(Request{pluginId, clientID, type, cmdName, request, false, QString(), {}});
+        if (onInsert) {
+            onInsert(int(requests.size()) - 1);
+        }
         return accept;
     }
     bool insertSubscribeRequest(const QString& pluginId, void* clientID, NSNovirTunnelClient::ServerType type,
@@ -118,6 +126,9 @@ public:
     {
         requests.append(
             Request{pluginId, clientID, type, cmdName, request, true, subscribedServerId, eventHandler});
+        if (onInsert) {
+            onInsert(int(requests.size()) - 1);
+        }
         return accept;
     }
     void registerConnectStatusHandler(const QString& pluginId, NSNovirTunnelClient::ServerType type,
@@ -126,6 +137,10 @@ public:
     {
         connectRegistrations.append(Registration{pluginId, type, QString()});
         connectHandlers.append(handler);
+        if (connectOnRegister) {
+            handler(handleOf(NSNovirTunnelClient::ConfigServer), NSNovirTunnelClient::ConfigServer, true);
+            handler(handleOf(NSNovirTunnelClient::LocationServer), NSNovirTunnelClient::LocationServer, true);
+        }
     }
     void registerEventHandler(const QString& pluginId, void*, NSNovirTunnelClient::ServerType type,
                               const QString& eventName, const NSNovirTunnelClient::EventHandler& handler,

@@ -152,6 +152,10 @@ TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrder)
         EXPECT_GE(hit.value(KEY_START_TIMESTAMP).toLongLong(), previous);
         previous = hit.value(KEY_START_TIMESTAMP).toLongLong();
         EXPECT_FALSE(hit.value(KEY_OBJ_IMAGE).toString().isEmpty());
+        // People carry their body vector as the camera sent it.
+        if (hit.value(KEY_OBJ_TYPE).toString() == QStringLiteral("Human")) {
+            EXPECT_EQ(hit.value(KEY_FEATURE).toList().size(), 512);
+        }
         ids.insert(hit.value(KEY_OBJECT_ID).toULongLong());
     }
     EXPECT_EQ(ids.size(), 201u);

@@ -35,3 +35,5 @@ int runDemo(const HostOptions& options);
 int runSeed(const HostOptions& options);
 // cameras: takes --site FILE besides the shared options.
 int runCameras(QStringList args);
+// serve: takes --site FILE and --listen ADDRESS:PORT besides the shared options.
+int runServe(QStringList args);

@@ -10,18 +10,20 @@ namespace {
 
 void printUsage(std::FILE* out)
 {
-    std::fprintf(out,
-                 "usage: delvix-host SUBCOMMAND [--data DIR] [--module PATH] ...\n"
-                 "  call COMMAND [JSON]   send one request, print each reply as a JSON line\n"
-                 "                        [--wait S] end after S s when no reply came (default 2)\n"
-                 "                        [--timeout S] give up waiting for the final reply (default 120)\n"
-                 "  demo                  load the plug-in and show what it does\n"
-                 "  cameras [--site FILE] start the configuration-server simulator on a site (default:\n"
-                 "                        a built-in one) and print the camera directory the plug-in learned\n"
-                 "  seed                  fill the data folder's store (DIR/Server) with synthetic objects\n"
-                 "                        [--objects N] (default 10000) [--locations L] (default 10)\n"
-                 "                        [--seed S] (default 1)\n"
-                 "  --data DIR            the host's data folder (default ./delvix-data)\n");
+    std::fprintf(
+        out, "usage: delvix-host SUBCOMMAND [--data DIR] [--module PATH] ...\n"
+             "  call COMMAND [JSON]   send one request, print each reply as a JSON line\n"
+             "                        [--wait S] end after S s when no reply came (default 2)\n"
+             "                        [--timeout S] give up waiting for the final reply (default 120)\n"
+             "  demo                  load the plug-in and show what it does\n"
+             "  seed                  fill the data folder's store (DIR/Server) with synthetic objects\n"
+             "                        [--objects N] (default 10000) [--locations L] (default 10)\n"
+             "                        [--seed S] (default 1)\n"
+             "  cameras [--site FILE] start the configuration-server simulator on a site (default:\n"
+             "                        a built-in one) and print the camera directory the plug-in learned\n"
+             "  serve [--site FILE] [--listen 127.0.0.1:PORT]\n"
+             "                        run the host with its local HTTP API (default port 8765)\n"
+             "  --data DIR            the host's data folder (default ./delvix-data)\n");
 }
 
 } // namespace
@@ -38,6 +40,9 @@ int main(int argc, char* argv[])
     const QString subcommand = args.takeFirst();
     if (subcommand == QLatin1String("cameras")) {
         return runCameras(args);
+    }
+    if (subcommand == QLatin1String("serve")) {
+        return runServe(args);
     }
     HostOptions options;
     QString error;

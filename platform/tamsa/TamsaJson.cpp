@@ -529,25 +529,33 @@ int formatFloat(float value, char* out)
         digits = 100000000u;
         ++k;
     }
-    char text[10];
+    // The nine digits are assembled in a register: writing them byte by byte and reading them
+    // back as one word would stall on store forwarding.
     const uint32_t high = digits / 10000000u; // the first two digits
     const uint32_t low = digits % 10000000u;
-    std::memcpy(text, kDigitPairs + 2 * high, 2);
-    std::memcpy(text + 2, kDigitPairs + 2 * (low / 100000u), 2);
-    std::memcpy(text + 4, kDigitPairs + 2 * ((low / 1000u) % 100u), 2);
-    std::memcpy(text + 6, kDigitPairs + 2 * ((low / 10u) % 100u), 2);
-    text[8] = char('0' + low % 10u);
+    auto pair = [](uint32_t value) {
+        uint16_t bytes = 0;
+        std::memcpy(&bytes, kDigitPairs + 2 * value, 2);
+        return uint64_t(bytes);
+    };
+    const uint64_t word = pair(high) | pair(low / 100000u) << 16 | pair((low / 1000u) % 100u) << 32 |
+                          pair((low / 10u) % 100u) << 48;
+    const char last = char('0' + low % 10u);
     int count = 9;
-    while (count > 1 && text[count - 1] == '0') {
+    for (uint32_t rest = digits; count > 1 && rest % 10 == 0; rest /= 10) {
         --count;
     }
     if (k < 0 && k >= -5) {
         // Feature values live here: fixed-size copies, then the pointer moves by the real length.
         std::memcpy(p, "0.000000", 8);
         p += 1 - k;
-        std::memcpy(p, text, 9);
+        std::memcpy(p, &word, 8);
+        p[8] = last;
         return int(p + count - out);
     }
+    char text[16];
+    std::memcpy(text, &word, 8);
+    text[8] = last;
     if (k >= 0 && k < 9) {
         const int integerDigits = k + 1;
         for (int i = 0; i < integerDigits; ++i) {

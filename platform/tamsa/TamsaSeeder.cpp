@@ -67,7 +67,7 @@ std::vector<float> gaussianUnitVector(uint64_t seed)
 // Six decimals: what a camera's JSON typically carries, and cheap to write.
 void appendFixed6(std::string* out, double value)
 {
-    long long scaled = std::llround(value * 1e6);
+    const long long scaled = (long long)(value * 1e6 + (value < 0 ? -0.5 : 0.5));
     char buffer[32];
     char* p = buffer + sizeof buffer;
     const bool negative = scaled < 0;
@@ -87,7 +87,7 @@ void appendFixed6(std::string* out, double value)
     out->append(p, size_t(buffer + sizeof buffer - p));
 }
 
-void appendNoisyVector(std::string* out, const std::vector<float>& identity, Random* random)
+void appendNoisyVector(std::string* out, const float* identity, Random* random)
 {
     out->push_back('[');
     for (size_t i = 0; i < kDim; ++i) {
@@ -226,6 +226,16 @@ TamsaSeeder::TamsaSeeder(const TamsaSeedOptions& options)
     for (const auto& colour : kPalette) {
         m_colourImages.push_back(pngBase64(colour[0], colour[1], colour[2]));
     }
+    m_bodies.resize(size_t(m_identities) * kDim);
+    m_faces.resize(size_t(m_identities) * kDim);
+    for (uint32_t identity = 0; identity < m_identities; ++identity) {
+        const std::vector<float> body =
+            gaussianUnitVector(mix(mix(m_options.seed) ^ (uint64_t(identity) << 1)));
+        const std::vector<float> face =
+            gaussianUnitVector(mix(mix(m_options.seed) ^ ((uint64_t(identity) << 1) | 1)));
+        std::copy(body.begin(), body.end(), m_bodies.begin() + std::ptrdiff_t(identity * kDim));
+        std::copy(face.begin(), face.end(), m_faces.begin() + std::ptrdiff_t(identity * kDim));
+    }
 }
 
 uint64_t TamsaSeeder::objectsAt(uint32_t location) const
@@ -239,12 +249,14 @@ uint64_t TamsaSeeder::objectsAt(uint32_t location) const
 
 std::vector<float> TamsaSeeder::identityBody(uint32_t identity) const
 {
-    return gaussianUnitVector(mix(mix(m_options.seed) ^ (uint64_t(identity) << 1)));
+    const auto begin = m_bodies.begin() + std::ptrdiff_t(size_t(identity % m_identities) * kDim);
+    return std::vector<float>(begin, begin + kDim);
 }
 
 std::vector<float> TamsaSeeder::identityFace(uint32_t identity) const
 {
-    return gaussianUnitVector(mix(mix(m_options.seed) ^ ((uint64_t(identity) << 1) | 1)));
+    const auto begin = m_faces.begin() + std::ptrdiff_t(size_t(identity % m_identities) * kDim);
+    return std::vector<float>(begin, begin + kDim);
 }
 
 static uint64_t objectSeed(uint32_t seed, uint32_t location, uint64_t index)
@@ -293,13 +305,13 @@ void TamsaSeeder::appendPerson(std::string* out, uint32_t location, uint64_t ind
     out->append(",\"Thumbnail\":[{\"image\":\"");
     out->append(m_colourImages[upper % m_colourImages.size()]);
     out->append("\",\"feature\":");
-    appendNoisyVector(out, identityBody(identity), &random);
+    appendNoisyVector(out, m_bodies.data() + size_t(identity) * kDim, &random);
     out->append("}]");
     if (random.below(10) < 6) {
         out->append(",\"FaceThumbnail\":[{\"image\":\"");
         out->append(m_colourImages[8]);
         out->append("\",\"feature\":");
-        appendNoisyVector(out, identityFace(identity), &random);
+        appendNoisyVector(out, m_faces.data() + size_t(identity) * kDim, &random);
         out->append(",\"face_detection_info\":{\"filtered\":");
         out->append(random.below(10) == 0 ? "1" : "0");
         out->append("}}]");

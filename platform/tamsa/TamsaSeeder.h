@@ -65,6 +65,9 @@ private:
     TamsaSeedOptions m_options;
     uint32_t m_identities = 1;
     std::vector<std::string> m_colourImages;
+    // Identity vectors, made once (each sighting is a noisy copy): identities x 512 floats.
+    std::vector<float> m_bodies;
+    std::vector<float> m_faces;
 };
 
 } // namespace tamsa

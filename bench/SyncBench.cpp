@@ -58,16 +58,16 @@ void BM_SyncPass200Cameras(benchmark::State& state)
 {
     QTemporaryDir dir; // default settings: period 60 s, delay 180 s
     QDir::setCurrent(dir.path());
-    QList<CameraSpec> specs;
+    QList<CameraSpec> setups;
     for (int i = 0; i < kCameras; ++i) {
-        CameraSpec spec;
-        spec.name = QStringLiteral("cam%1").arg(i, 3, 10, QLatin1Char('0'));
-        spec.objectsPerMinute = 50;
-        spec.protectedMetadata = i % 10 == 0; // every tenth camera asks for an access token
-        specs.append(spec);
+        CameraSpec setup;
+        setup.name = QStringLiteral("cam%1").arg(i, 3, 10, QLatin1Char('0'));
+        setup.objectsPerMinute = 50;
+        setup.protectedMetadata = i % 10 == 0; // every tenth camera asks for an access token
+        setups.append(setup);
     }
     CameraSimulator cameras;
-    if (!cameras.start(specs)) {
+    if (!cameras.start(setups)) {
         state.SkipWithError("cameras did not start");
         return;
     }

@@ -30,12 +30,12 @@ bool CameraSimulator::start(const QList<CameraSpec>& cameras, QString* error)
     QMetaObject::invokeMethod(
         m_context,
         [&]() {
-            for (CameraSpec spec : cameras) {
-                if (spec.locationNumber == 0) {
-                    spec.locationNumber = nextLocation;
+            for (CameraSpec setup : cameras) {
+                if (setup.locationNumber == 0) {
+                    setup.locationNumber = nextLocation;
                 }
-                nextLocation = qMax(nextLocation, spec.locationNumber) + 1;
-                auto* camera = new SimulatedCamera(spec, &m_generator, m_tokenOptions,
+                nextLocation = qMax(nextLocation, setup.locationNumber) + 1;
+                auto* camera = new SimulatedCamera(setup, &m_generator, m_tokenOptions,
                                                    [this](const ServedRequest& served) {
                                                        QMutexLocker lock(&m_mutex);
                                                        m_served.append(served);
@@ -84,7 +84,7 @@ void CameraSimulator::runOnCameraThread(const std::function<void()>& work)
 SimulatedCamera* CameraSimulator::find(const QString& camera) const
 {
     for (SimulatedCamera* c : m_cameras) {
-        if (c->spec().name == camera) {
+        if (c->setup().name == camera) {
             return c;
         }
     }
@@ -142,22 +142,22 @@ QVariantMap CameraSimulator::directoryRecord(const QString& camera, int channel)
     if (!c) {
         return QVariantMap();
     }
-    const CameraSpec& spec = c->spec();
+    const CameraSpec& setup = c->setup();
     QVariantMap record;
     record.insert(QStringLiteral("Name"),
-                  channel >= 0 ? spec.name + QStringLiteral("-c") + QString::number(channel) : spec.name);
+                  channel >= 0 ? setup.name + QStringLiteral("-c") + QString::number(channel) : setup.name);
     record.insert(QStringLiteral("IP"), QStringLiteral("127.0.0.1"));
     record.insert(QStringLiteral("Port"), int(c->port()));
-    record.insert(QStringLiteral("User"), spec.user);
-    record.insert(QStringLiteral("Password"), QString::fromLatin1(spec.password.toLatin1().toHex()));
-    record.insert(QStringLiteral("UseSSL"), spec.useSSL);
-    record.insert(QStringLiteral("DelvixProtect"), spec.protectedMetadata);
+    record.insert(QStringLiteral("User"), setup.user);
+    record.insert(QStringLiteral("Password"), QString::fromLatin1(setup.password.toLatin1().toHex()));
+    record.insert(QStringLiteral("UseSSL"), setup.useSSL);
+    record.insert(QStringLiteral("DelvixProtect"), setup.protectedMetadata);
     if (channel >= 0) {
         record.insert(QStringLiteral("MultiChannelID"), QString::number(channel));
     }
     record.insert(QStringLiteral("Location"),
-                  QStringLiteral("Loc") + QString::number(spec.locationNumber + qMax(0, channel) * 1000));
-    record.insert(QStringLiteral("GroupID"), spec.groupID);
+                  QStringLiteral("Loc") + QString::number(setup.locationNumber + qMax(0, channel) * 1000));
+    record.insert(QStringLiteral("GroupID"), setup.groupID);
     record.insert(QStringLiteral("IsRecording"), true);
     return record;
 }
@@ -166,14 +166,14 @@ QVariantMap CameraSimulator::directoryMap() const
 {
     QVariantMap map;
     for (SimulatedCamera* c : m_cameras) {
-        const CameraSpec& spec = c->spec();
-        if (spec.channels > 1) {
-            for (int channel = 0; channel < spec.channels; ++channel) {
-                const QVariantMap record = directoryRecord(spec.name, channel);
+        const CameraSpec& setup = c->setup();
+        if (setup.channels > 1) {
+            for (int channel = 0; channel < setup.channels; ++channel) {
+                const QVariantMap record = directoryRecord(setup.name, channel);
                 map.insert(record.value(QStringLiteral("Name")).toString(), record);
             }
         } else {
-            map.insert(spec.name, directoryRecord(spec.name));
+            map.insert(setup.name, directoryRecord(setup.name));
         }
     }
     return map;

@@ -81,11 +81,11 @@ QByteArray reason(int status)
 
 } // namespace
 
-SimulatedCamera::SimulatedCamera(const CameraSpec& spec, const ObjectGenerator* generator,
+SimulatedCamera::SimulatedCamera(const CameraSpec& setup, const ObjectGenerator* generator,
                                  Zelto::ManagerOptions tokenOptions,
                                  std::function<void(const ServedRequest&)> onServed, QObject* parent)
     : QAbstractHttpServer(parent)
-    , m_spec(spec)
+    , m_setup(setup)
     , m_generator(generator)
     , m_tokenOptions(std::move(tokenOptions))
     , m_onServed(std::move(onServed))
@@ -93,12 +93,13 @@ SimulatedCamera::SimulatedCamera(const CameraSpec& spec, const ObjectGenerator* 
 
 bool SimulatedCamera::listenOnLoopback(QString* error)
 {
-    if (m_spec.useSSL) {
+    if (m_setup.useSSL) {
         sslSetup(QSslCertificate(QByteArray(kCertificatePem)), QSslKey(QByteArray(kPrivateKeyPem), QSsl::Ec));
     }
-    m_port = listen(QHostAddress::LocalHost, m_spec.port);
+    m_port = listen(QHostAddress::LocalHost, m_setup.port);
     if (m_port == 0 && error) {
-        *error = QStringLiteral("camera %1 cannot listen on 127.0.0.1:%2").arg(m_spec.name).arg(m_spec.port);
+        *error =
+            QStringLiteral("camera %1 cannot listen on 127.0.0.1:%2").arg(m_setup.name).arg(m_setup.port);
     }
     return m_port != 0;
 }
@@ -112,23 +113,23 @@ QStringList SimulatedCamera::issuedPairTokens() const
 bool SimulatedCamera::authorised(const QHttpServerRequest& request) const
 {
     const QByteArray header = request.value("Authorization");
-    if (m_spec.digestAuth) {
+    if (m_setup.digestAuth) {
         return header.startsWith("Digest ") && digestAuthorised(header.mid(7));
     }
     if (!header.startsWith("Basic ")) {
         return false;
     }
     return QByteArray::fromBase64(header.mid(6).trimmed()) ==
-           (m_spec.user + QLatin1Char(':') + m_spec.password).toUtf8();
+           (m_setup.user + QLatin1Char(':') + m_setup.password).toUtf8();
 }
 
 bool SimulatedCamera::digestAuthorised(const QByteArray& header) const
 {
     const auto f = digestFields(header);
-    if (f.value("username") != m_spec.user.toUtf8() || !m_nonces.contains(f.value("nonce"))) {
+    if (f.value("username") != m_setup.user.toUtf8() || !m_nonces.contains(f.value("nonce"))) {
         return false;
     }
-    const QByteArray ha1 = md5Hex(m_spec.user.toUtf8() + ':' + kRealm + ':' + m_spec.password.toUtf8());
+    const QByteArray ha1 = md5Hex(m_setup.user.toUtf8() + ':' + kRealm + ':' + m_setup.password.toUtf8());
     const QByteArray ha2 = md5Hex("GET:" + f.value("uri"));
     const QByteArray expected = f.contains("qop")
                                     ? md5Hex(ha1 + ':' + f.value("nonce") + ':' + f.value("nc") + ':' +
@@ -143,7 +144,7 @@ SimulatedCamera::Answer SimulatedCamera::challenge()
     answer.status = 401;
     answer.contentType = "text/plain";
     answer.body = "authentication required";
-    if (m_spec.digestAuth) {
+    if (m_setup.digestAuth) {
         const QByteArray nonce = QByteArray::number(QRandomGenerator::global()->generate64(), 16);
         m_nonces.insert(nonce);
         answer.extraHeaders = QByteArray("WWW-Authenticate: Digest realm=\"") + kRealm +
@@ -160,7 +161,7 @@ bool SimulatedCamera::handleRequest(const QHttpServerRequest& request, QTcpSocke
         QStringLiteral("^/VCA(?:/c(\\d+))?/(Data/DB/ObjectMeta|Data/DB/ObjMeta|Secure/Token)$"));
     const QUrl url = request.url();
     ServedRequest served;
-    served.camera = m_spec.name;
+    served.camera = m_setup.name;
     served.path = QString::fromUtf8(url.toEncoded(QUrl::RemoveScheme | QUrl::RemoveAuthority));
 
     Answer answer;
@@ -179,7 +180,7 @@ bool SimulatedCamera::handleRequest(const QHttpServerRequest& request, QTcpSocke
         bool channelOk = true;
         if (match.capturedLength(1) > 0) {
             served.channel = match.captured(1).toInt(&channelOk);
-            channelOk = channelOk && m_spec.channels > 1 && served.channel < m_spec.channels;
+            channelOk = channelOk && m_setup.channels > 1 && served.channel < m_setup.channels;
         }
         if (!channelOk) {
             answer.status = 404;
@@ -200,8 +201,8 @@ bool SimulatedCamera::handleRequest(const QHttpServerRequest& request, QTcpSocke
                 query.queryItemValue(QStringLiteral("accessToken"), QUrl::FullyDecoded);
             served.withAccessToken = !accessToken.isEmpty();
             const bool tokenPath = action == QLatin1String("Data/DB/ObjMeta");
-            bool allowed = !m_spec.protectedMetadata;
-            if (m_spec.protectedMetadata && tokenPath) {
+            bool allowed = !m_setup.protectedMetadata;
+            if (m_setup.protectedMetadata && tokenPath) {
                 for (const QString& pairToken : issuedPairTokens()) {
                     auto manager = Zelto::CreateProtectedAPIManager(m_tokenOptions);
                     const QByteArray bytes = pairToken.toUtf8();
@@ -222,11 +223,11 @@ bool SimulatedCamera::handleRequest(const QHttpServerRequest& request, QTcpSocke
                 answer.status = 400;
                 answer.body = "{\"error\":\"bad time window\"}";
             } else {
-                const QString source =
-                    served.channel >= 0 ? m_spec.name + QStringLiteral("/c") + QString::number(served.channel)
-                                        : m_spec.name;
-                answer.body = m_generator->answer(source, start, end, m_spec.objectsPerMinute);
-                served.objectCount = m_generator->objectCount(source, start, end, m_spec.objectsPerMinute);
+                const QString source = served.channel >= 0 ? m_setup.name + QStringLiteral("/c") +
+                                                                 QString::number(served.channel)
+                                                           : m_setup.name;
+                answer.body = m_generator->answer(source, start, end, m_setup.objectsPerMinute);
+                served.objectCount = m_generator->objectCount(source, start, end, m_setup.objectsPerMinute);
                 if (m_malformed) {
                     answer.body.chop(answer.body.size() / 2 + 1); // cut mid-object: not JSON any more
                 }

@@ -246,15 +246,15 @@ TEST(CameraSimulatorPorts, FixedPortIsUsedAndATakenOneIsReported)
         ASSERT_TRUE(probe.listen(QHostAddress::LocalHost, 0));
         free = probe.serverPort();
     }
-    CameraSpec spec;
-    spec.name = QStringLiteral("fixed");
-    spec.port = free;
+    CameraSpec setup;
+    setup.name = QStringLiteral("fixed");
+    setup.port = free;
     CameraSimulator first;
-    ASSERT_TRUE(first.start({spec}));
+    ASSERT_TRUE(first.start({setup}));
     EXPECT_EQ(first.port("fixed"), free);
     CameraSimulator second;
     QString error;
-    EXPECT_FALSE(second.start({spec}, &error));
+    EXPECT_FALSE(second.start({setup}, &error));
     EXPECT_TRUE(error.contains(QString::number(free))) << qPrintable(error);
     EXPECT_EQ(second.port("fixed"), 0);
 }

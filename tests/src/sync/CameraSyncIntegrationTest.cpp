@@ -26,11 +26,11 @@ bool waitFor(const std::function<bool()>& condition, int limitMs = 15000)
 
 CameraSpec camera(const char* name)
 {
-    CameraSpec spec;
-    spec.name = QString::fromLatin1(name);
-    spec.password = QStringLiteral("pa:ss");
-    spec.objectsPerMinute = 20;
-    return spec;
+    CameraSpec setup;
+    setup.name = QString::fromLatin1(name);
+    setup.password = QStringLiteral("pa:ss");
+    setup.objectsPerMinute = 20;
+    return setup;
 }
 
 } // namespace

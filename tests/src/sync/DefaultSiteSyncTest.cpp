@@ -41,20 +41,20 @@ TEST(DefaultSiteSync, EveryRecordingLocationOfTheSiteIsFetchedAndStored)
     NovirSite site = NovirSite::defaultSite();
     QMap<int, CameraSpec> byPort;
     for (const NovirCamera& camera : site.cameras) {
-        CameraSpec& spec = byPort[camera.port];
-        if (spec.name.isEmpty()) {
-            spec.name = camera.name;
+        CameraSpec& setup = byPort[camera.port];
+        if (setup.name.isEmpty()) {
+            setup.name = camera.name;
         }
-        spec.user = camera.user;
-        spec.password = camera.password;
-        spec.protectedMetadata = spec.protectedMetadata || camera.protectCap;
-        spec.channels = qMax(spec.channels, camera.channelCount);
-        spec.objectsPerMinute = 600;
+        setup.user = camera.user;
+        setup.password = camera.password;
+        setup.protectedMetadata = setup.protectedMetadata || camera.protectCap;
+        setup.channels = qMax(setup.channels, camera.channelCount);
+        setup.objectsPerMinute = 600;
     }
     QSet<QString> protectedCameras;
-    for (const CameraSpec& spec : byPort) {
-        if (spec.protectedMetadata) {
-            protectedCameras.insert(spec.name);
+    for (const CameraSpec& setup : byPort) {
+        if (setup.protectedMetadata) {
+            protectedCameras.insert(setup.name);
         }
     }
     CameraSimulator cameras;

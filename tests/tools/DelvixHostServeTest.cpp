@@ -4,6 +4,7 @@
 #include <QCoreApplication>
 #include <QElapsedTimer>
 #include <QEventLoop>
+#include <QFile>
 #include <QJsonDocument>
 #include <QJsonObject>
 #include <QNetworkAccessManager>
@@ -138,4 +139,26 @@ TEST(ServeArguments, RefusesNonLoopbackAddressesAndBadOptions)
     std::tie(code, err) = run({QStringLiteral("--site"), data.filePath(QStringLiteral("missing.json"))});
     EXPECT_NE(code, 0);
     EXPECT_FALSE(err.isEmpty());
+}
+
+TEST(DemoProgram, RunsTheWholeSystemAndReportsItComplete)
+{
+    QTemporaryDir data;
+    QProcess process;
+    process.start(QStringLiteral(DELVIX_HOST_PATH),
+                  {QStringLiteral("demo"), QStringLiteral("--data"), data.filePath(QStringLiteral("demo"))});
+    ASSERT_TRUE(process.waitForFinished(110000));
+    const QByteArray out = process.readAllStandardOutput();
+    EXPECT_EQ(process.exitCode(), 0) << out.constData() << process.readAllStandardError().constData();
+    EXPECT_TRUE(out.contains("demo complete")) << out.constData();
+    // Every step found something: cameras, stored objects, hits, sightings elsewhere, a case.
+    for (const char* stepName : {"camera directory", "metadata synchronisation", "attribute search",
+                                 "re-identification", "case workflow"}) {
+        const QRegularExpression line(QStringLiteral("%1\\s+\\d+ ms\\s+(\\d+)").arg(QLatin1String(stepName)));
+        const QRegularExpressionMatch match = line.match(QString::fromUtf8(out));
+        ASSERT_TRUE(match.hasMatch()) << stepName;
+        EXPECT_GT(match.captured(1).toInt(), 0) << stepName;
+    }
+    EXPECT_TRUE(out.contains("bookmarks left: 0"));
+    EXPECT_TRUE(QFile::exists(data.filePath(QStringLiteral("demo/database/PluginDelvix/CaseVault.db"))));
 }

@@ -129,54 +129,69 @@ int64_t TamsaFeatureMap::rowsOnDisk(const std::string& vectorPath, const std::st
     return std::min(vectorBytes / int64_t(kFeatureRowBytes), infoBytes / int64_t(sizeof(FeatureRowInfo)));
 }
 
-std::shared_ptr<const TamsaFeatureMap> TamsaFeatureMap::map(const std::string& vectorPath,
-                                                            const std::string& infoPath)
+struct TamsaFeatureMap::Mapping
+{
+    void* vectorBase = nullptr;
+    size_t vectorBytes = 0;
+    void* infoBase = nullptr;
+    size_t infoBytes = 0;
+    int64_t capacityRows = 0;
+
+    ~Mapping()
+    {
+        if (vectorBase) {
+            ::munmap(vectorBase, vectorBytes);
+        }
+        if (infoBase) {
+            ::munmap(infoBase, infoBytes);
+        }
+    }
+};
+
+std::shared_ptr<const TamsaFeatureMap>
+TamsaFeatureMap::map(const std::string& vectorPath, const std::string& infoPath,
+                     const std::shared_ptr<const TamsaFeatureMap>& previous)
 {
     const int64_t rows = rowsOnDisk(vectorPath, infoPath);
     if (rows <= 0) {
         return nullptr;
     }
-    const int vectorFd = ::open(vectorPath.c_str(), O_RDONLY | O_CLOEXEC);
-    const int infoFd = ::open(infoPath.c_str(), O_RDONLY | O_CLOEXEC);
     std::shared_ptr<TamsaFeatureMap> result(new TamsaFeatureMap);
-    if (vectorFd >= 0 && infoFd >= 0) {
-        result->m_vectorBytes = size_t(rows) * kFeatureRowBytes;
-        result->m_infoBytes = size_t(rows) * sizeof(FeatureRowInfo);
-        // Populated up front: the scan then runs at memory speed from its first search.
-        void* vectors =
-            ::mmap(nullptr, result->m_vectorBytes, PROT_READ, MAP_SHARED | MAP_POPULATE, vectorFd, 0);
-        void* infos = ::mmap(nullptr, result->m_infoBytes, PROT_READ, MAP_SHARED | MAP_POPULATE, infoFd, 0);
-        if (vectors != MAP_FAILED) {
-            result->m_vectorBase = vectors;
-        }
-        if (infos != MAP_FAILED) {
-            result->m_infoBase = infos;
-        }
-    }
-    if (vectorFd >= 0) {
-        ::close(vectorFd);
-    }
-    if (infoFd >= 0) {
-        ::close(infoFd);
-    }
-    if (!result->m_vectorBase || !result->m_infoBase) {
-        return nullptr;
-    }
-    ::madvise(result->m_vectorBase, result->m_vectorBytes, MADV_SEQUENTIAL);
-    result->m_vectors = static_cast<const float*>(result->m_vectorBase);
-    result->m_infos = static_cast<const FeatureRowInfo*>(result->m_infoBase);
     result->m_rows = rows;
+    if (previous && previous->m_mapping && rows <= previous->m_mapping->capacityRows) {
+        result->m_mapping = previous->m_mapping;
+    } else {
+        auto mapping = std::make_shared<Mapping>();
+        // Room for the file to grow by half again (at least 16384 rows) before a new mapping.
+        mapping->capacityRows = std::max(rows + rows / 2, rows + 16384);
+        mapping->vectorBytes = size_t(mapping->capacityRows) * kFeatureRowBytes;
+        mapping->infoBytes = size_t(mapping->capacityRows) * sizeof(FeatureRowInfo);
+        const int vectorFd = ::open(vectorPath.c_str(), O_RDONLY | O_CLOEXEC);
+        const int infoFd = ::open(infoPath.c_str(), O_RDONLY | O_CLOEXEC);
+        if (vectorFd >= 0 && infoFd >= 0) {
+            // Populated up front (the part the files hold): the scan then runs at memory speed.
+            void* vectors =
+                ::mmap(nullptr, mapping->vectorBytes, PROT_READ, MAP_SHARED | MAP_POPULATE, vectorFd, 0);
+            void* infos =
+                ::mmap(nullptr, mapping->infoBytes, PROT_READ, MAP_SHARED | MAP_POPULATE, infoFd, 0);
+            mapping->vectorBase = vectors != MAP_FAILED ? vectors : nullptr;
+            mapping->infoBase = infos != MAP_FAILED ? infos : nullptr;
+        }
+        if (vectorFd >= 0) {
+            ::close(vectorFd);
+        }
+        if (infoFd >= 0) {
+            ::close(infoFd);
+        }
+        if (!mapping->vectorBase || !mapping->infoBase) {
+            return nullptr;
+        }
+        ::madvise(mapping->vectorBase, mapping->vectorBytes, MADV_SEQUENTIAL);
+        result->m_mapping = mapping;
+    }
+    result->m_vectors = static_cast<const float*>(result->m_mapping->vectorBase);
+    result->m_infos = static_cast<const FeatureRowInfo*>(result->m_mapping->infoBase);
     return result;
-}
-
-TamsaFeatureMap::~TamsaFeatureMap()
-{
-    if (m_vectorBase) {
-        ::munmap(m_vectorBase, m_vectorBytes);
-    }
-    if (m_infoBase) {
-        ::munmap(m_infoBase, m_infoBytes);
-    }
 }
 
 } // namespace tamsa

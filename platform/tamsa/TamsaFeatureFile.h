@@ -59,27 +59,28 @@ private:
     std::vector<FeatureRowInfo> m_pendingInfos;
 };
 
-// A read-only mapping of the rows present when it was made.
+// A read-only view of the rows present when it was made. Views of a growing file share one
+// mapping that reserves room beyond the end of the file, so a search after an ingest does not
+// map (and fault in) the whole file again; only rows below rows() are ever read.
 class TamsaFeatureMap
 {
 public:
-    // Maps the complete rows of both files; null when the files are missing or empty.
-    static std::shared_ptr<const TamsaFeatureMap> map(const std::string& vectorPath,
-                                                      const std::string& infoPath);
+    // Maps the complete rows of both files, reusing `previous`'s mapping while the rows fit in
+    // it; null when the files are missing or empty.
+    static std::shared_ptr<const TamsaFeatureMap>
+    map(const std::string& vectorPath, const std::string& infoPath,
+        const std::shared_ptr<const TamsaFeatureMap>& previous = {});
     // Number of complete rows the files hold now (cheap: two stat calls).
     static int64_t rowsOnDisk(const std::string& vectorPath, const std::string& infoPath);
-    ~TamsaFeatureMap();
 
     int64_t rows() const { return m_rows; }
     const float* vector(int64_t row) const { return m_vectors + size_t(row) * kFeatureDim; }
     const FeatureRowInfo& info(int64_t row) const { return m_infos[row]; }
 
 private:
+    struct Mapping;
     TamsaFeatureMap() = default;
-    void* m_vectorBase = nullptr;
-    size_t m_vectorBytes = 0;
-    void* m_infoBase = nullptr;
-    size_t m_infoBytes = 0;
+    std::shared_ptr<const Mapping> m_mapping;
     const float* m_vectors = nullptr;
     const FeatureRowInfo* m_infos = nullptr;
     int64_t m_rows = 0;

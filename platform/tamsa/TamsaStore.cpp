@@ -324,7 +324,7 @@ std::shared_ptr<const TamsaFeatureMap> TamsaStore::featureMap(uint32_t location,
         cached->rows() == TamsaFeatureMap::rowsOnDisk(vectors, infos)) {
         return cached;
     }
-    cached = TamsaFeatureMap::map(vectors, infos);
+    cached = TamsaFeatureMap::map(vectors, infos, cached);
     return cached;
 }
 

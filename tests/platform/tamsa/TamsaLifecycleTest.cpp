@@ -298,6 +298,13 @@ TEST_F(TamsaLifecycleTest, HandlesSearchAndIngestOnSeveralThreadsAtOnce)
     QuerySpec third;
     third.locations = {3};
     EXPECT_EQ(searchIds(third).size(), 100u);
+
+    // Vectors ingested after a search mapped the files are found by the next search.
+    third.feature = jsonArray(randomUnitVector(5099));
+    EXPECT_EQ(searchIds(third), Ids{5099});
+    ASSERT_EQ(put(3, manyObjects(7000, 5, true)), 5);
+    third.feature = jsonArray(randomUnitVector(7004));
+    EXPECT_EQ(searchIds(third), Ids{7004});
 }
 
 } // namespace

@@ -24,9 +24,17 @@
 // every later Next; the caller still calls Close.
 //
 // Storage: files under the directory given to Tamsa_SetStoragesDBPath (created on first use).
-// Tamsa_PutObjectMetaInfo returns only after the objects it counts are on disk: they survive a
-// crash of the process (set TAMSA_SYNC=full to also sync them to the device, surviving a power
+// Tamsa_PutObjectMetaInfo returns only after the objects it counts are written to the store's
+// files: they survive a crash of the process (set TAMSA_SYNC=full to also sync them to the device, surviving a power
 // loss, at a much lower ingest rate). Several processes may share a directory.
+//
+// Matching, where a choice had to be made: a two-point trace is a finite tripwire (the path must
+// touch the segment between the points while changing side); a zone is entered when a
+// trajectory point lies inside it or a trajectory segment crosses its border; loitering needs a
+// run of consecutive points inside spanning dwDuration seconds. Feature texts may be shorter
+// than the stored 512-float vectors (the first n elements count); longer ones score 0. A query
+// text that does not parse (attributes not an object, trace not a list of >= 2 points, feature
+// not a list of numbers) fails First with TAMSA_E_BAD_QUERY rather than matching everything.
 
 #include <cstddef>
 #include <cstdint>

@@ -287,33 +287,9 @@ TTAMSA_OBJECTMETAINFO_QUERY AttributeQueryWorker::composeQueryCondition(
     return query;
 }
 
-long AttributeQueryWorker::getObjectMetaInfoFirst(const QVariantMap& params, void** database,
-                                                  void** search) const
+std::vector<uint32_t> AttributeQueryWorker::locationNumbers(const QStringList& locationIds)
 {
-    // Timestamps are unsigned milliseconds; anything beyond the signed range is far beyond
-    // 32-bit seconds anyway and clamps the same way.
-    const auto toSignedMs = [](const QVariant& value) {
-        const qulonglong ms = value.toULongLong();
-        return ms > qulonglong(std::numeric_limits<qint64>::max()) ? std::numeric_limits<qint64>::max()
-                                                                   : qint64(ms);
-    };
-    const qint64 startMs = toSignedMs(params.value(KEY_START_TIMESTAMP));
-    const qint64 endMs = toSignedMs(params.value(KEY_END_TIMESTAMP));
-
-    if (m_tamsa->initDatabase(database) != 0) {
-        DELVIX_LOG(LogFacility::LevelError, "%s, m_tamsa->initDatabase failed",
-                   "AttributeQueryWorker::getObjectMetaInfoFirst");
-    }
-
-    const QVariantMap rule = params.value(KEY_RULE_INFO).toMap();
-    const QString ruleType = rule.value(KEY_TYPE).toString();
-    const bool loitering = ruleType == KEY_LOITERING;
-    const std::string trace = rule.value(KEY_TRACE).toString().toStdString();
-    const uint32_t duration = rule.value(KEY_DURATION).toUInt();
-    const int direction = ruleType == KEY_LINE_CROSSING ? rule.value(KEY_DIRECTION).toInt() : 0;
-
     std::vector<uint32_t> locations;
-    const QStringList locationIds = params.value(KEY_LOC_ID_LIST).toStringList();
     for (const QString& locationId : locationIds) {
         if (locationId.isEmpty()) {
             continue;
@@ -325,28 +301,73 @@ long AttributeQueryWorker::getObjectMetaInfoFirst(const QVariantMap& params, voi
         // An unparsable entry becomes 0 and so ends the store's list there.
         locations.push_back(ok ? number : 0);
     }
-    if (locations.empty()) {
-        return kNoLocation;
+    if (!locations.empty()) {
+        locations.push_back(0);
     }
-    locations.push_back(0);
+    return locations;
+}
+
+AttributeQueryWorker::StoreRequest AttributeQueryWorker::readRequest(const QVariantMap& params) const
+{
+    StoreRequest request;
+    // Timestamps are unsigned milliseconds; anything beyond the signed range is far beyond
+    // 32-bit seconds anyway and clamps the same way.
+    const auto toSignedMs = [](const QVariant& value) {
+        const qulonglong ms = value.toULongLong();
+        return ms > qulonglong(std::numeric_limits<qint64>::max()) ? std::numeric_limits<qint64>::max()
+                                                                   : qint64(ms);
+    };
+    request.startMs = toSignedMs(params.value(KEY_START_TIMESTAMP));
+    request.endMs = toSignedMs(params.value(KEY_END_TIMESTAMP));
+
+    const QVariantMap rule = params.value(KEY_RULE_INFO).toMap();
+    const QString ruleType = rule.value(KEY_TYPE).toString();
+    request.loitering = ruleType == KEY_LOITERING;
+    request.trace = rule.value(KEY_TRACE).toString().toStdString();
+    request.duration = rule.value(KEY_DURATION).toUInt();
+    request.direction = ruleType == KEY_LINE_CROSSING ? rule.value(KEY_DIRECTION).toInt() : 0;
+
+    request.locations = locationNumbers(params.value(KEY_LOC_ID_LIST).toStringList());
 
     const QStringList human = extractAndRemoveKeyFromJson(
         params.value(KEY_HUMAN_INFO).toString(), {TAMSA_ATTR_AGE, TAMSA_ATTR_GENDER, TAMSA_ATTR_ACCESSORIES});
     const QStringList vehicle = extractAndRemoveKeyFromJson(params.value(KEY_VEHICLE_INFO).toString(),
                                                             {TAMSA_ATTR_TYPE, TAMSA_PLATE_NUMBER});
-    const std::string feature = compactJson(params.value(KEY_FEATURE).toList());
-    const std::string faceFeature = compactJson(params.value(KEY_FACE_FEATURE).toList());
-    const std::string plateNumber = params.value(KEY_PLATE_NUMBER).toString().toStdString();
-    const std::string humanOther = human.at(0).toStdString();
-    const std::string humanPrimary = human.at(1).toStdString();
-    const std::string vehicleOther = vehicle.at(0).toStdString();
-    const std::string vehiclePrimary = vehicle.at(1).toStdString();
+    request.humanOther = human.at(0).toStdString();
+    request.humanPrimary = human.at(1).toStdString();
+    request.vehicleOther = vehicle.at(0).toStdString();
+    request.vehiclePrimary = vehicle.at(1).toStdString();
+    request.descending = params.value(KEY_DESCENDING).toBool();
+    request.doNotSort = params.value(KEY_DO_NOT_SORT).toBool();
+    request.feature = compactJson(params.value(KEY_FEATURE).toList());
+    request.faceFeature = compactJson(params.value(KEY_FACE_FEATURE).toList());
+    request.plateNumber = params.value(KEY_PLATE_NUMBER).toString().toStdString();
+    return request;
+}
 
-    const TTAMSA_OBJECTMETAINFO_QUERY query = composeQueryCondition(
-        startMs, endMs, humanOther, humanPrimary, vehicleOther, vehiclePrimary, loitering, trace, duration,
-        direction, locations, params.value(KEY_DESCENDING).toBool(), params.value(KEY_DO_NOT_SORT).toBool(),
-        feature, faceFeature, plateNumber);
+long AttributeQueryWorker::openSearch(const StoreRequest& request, const std::vector<uint32_t>& locations,
+                                      void** database, void** search) const
+{
+    if (m_tamsa->initDatabase(database) != 0) {
+        DELVIX_LOG(LogFacility::LevelError, "%s, m_tamsa->initDatabase failed",
+                   "AttributeQueryWorker::getObjectMetaInfoFirst");
+    }
+    if (locations.empty()) {
+        return kNoLocation;
+    }
+    const TTAMSA_OBJECTMETAINFO_QUERY query =
+        composeQueryCondition(request.startMs, request.endMs, request.humanOther, request.humanPrimary,
+                              request.vehicleOther, request.vehiclePrimary, request.loitering, request.trace,
+                              request.duration, request.direction, locations, request.descending,
+                              request.doNotSort, request.feature, request.faceFeature, request.plateNumber);
     return m_tamsa->GetObjectMetaInfoFirst(*database, &query, search);
+}
+
+long AttributeQueryWorker::getObjectMetaInfoFirst(const QVariantMap& params, void** database,
+                                                  void** search) const
+{
+    const StoreRequest request = readRequest(params);
+    return openSearch(request, request.locations, database, search);
 }
 
 QVariantMap AttributeQueryWorker::toSearchRecord(const TTAMSA_OBJECTMETAINFO_RESULT& result, JsonRoute route)
@@ -450,14 +471,21 @@ void AttributeQueryWorker::query(const QVariantMap& params, const Callback& call
 void AttributeQueryWorker::reId(const QVariantMap& params, const Callback& callback)
 {
     DELVIX_SCOPE_TRACE("AttributeQueryWorker::reId");
-    const QStringList locations = params.value(KEY_LOC_ID_LIST).toStringList();
-    const auto subRequest = [&params](const QString& location) {
-        QVariantMap sub = params;
-        sub.insert(KEY_LOC_ID_LIST, QVariantList{location});
-        return sub;
-    };
-
     try {
+        const QStringList locations = params.value(KEY_LOC_ID_LIST).toStringList();
+        // Everything but the location is the same for every location: read, and turn the
+        // feature vectors into text, once.
+        struct Shared
+        {
+            StoreRequest request;
+            std::vector<float> body;
+            std::vector<float> face;
+        };
+        auto shared = std::make_shared<Shared>();
+        shared->request = readRequest(reIdStoreRequest(params));
+        shared->body = toFloatVector(params.value(KEY_FEATURE));
+        shared->face = toFloatVector(params.value(KEY_FACE_FEATURE));
+
         std::unique_ptr<boost::asio::thread_pool> pool;
         if (m_bParallel.load() && !locations.isEmpty()) {
             try {
@@ -469,12 +497,13 @@ void AttributeQueryWorker::reId(const QVariantMap& params, const Callback& callb
             }
         }
         for (const QString& location : locations) {
+            std::vector<uint32_t> one = locationNumbers({location});
             if (pool) {
-                boost::asio::post(*pool, [this, sub = subRequest(location), callback]() {
-                    partialReIdSearch(sub, callback);
+                boost::asio::post(*pool, [this, shared, one = std::move(one), callback]() {
+                    searchLocation(shared->request, one, shared->body, shared->face, callback);
                 });
             } else {
-                partialReIdSearch(subRequest(location), callback);
+                searchLocation(shared->request, one, shared->body, shared->face, callback);
             }
         }
         if (pool) {
@@ -488,24 +517,42 @@ void AttributeQueryWorker::reId(const QVariantMap& params, const Callback& callb
     deliver(callback, true, QVariantMap());
 }
 
+QVariantMap AttributeQueryWorker::reIdStoreRequest(const QVariantMap& params)
+{
+    QVariantMap request = params;
+    request.insert(KEY_HUMAN_INFO, QStringLiteral("{}"));
+    request.insert(KEY_VEHICLE_INFO, QString());
+    request.insert(KEY_RULE_INFO, QString());
+    request.insert(KEY_DESCENDING, 1);
+    request.insert(KEY_DO_NOT_SORT, true);
+    return request;
+}
+
 void AttributeQueryWorker::partialReIdSearch(const QVariantMap& params, const Callback& callback)
+{
+    try {
+        const StoreRequest request = readRequest(reIdStoreRequest(params));
+        searchLocation(request, request.locations, toFloatVector(params.value(KEY_FEATURE)),
+                       toFloatVector(params.value(KEY_FACE_FEATURE)), callback);
+    } catch (const std::exception& e) {
+        DELVIX_LOG(LogFacility::LevelError, "%s, search failed: %s",
+                   "AttributeQueryWorker::partialReIdSearch", e.what());
+    } catch (...) {
+        DELVIX_LOG(LogFacility::LevelError, "%s, search failed", "AttributeQueryWorker::partialReIdSearch");
+    }
+}
+
+void AttributeQueryWorker::searchLocation(const StoreRequest& request, const std::vector<uint32_t>& locations,
+                                          const std::vector<float>& body, const std::vector<float>& face,
+                                          const Callback& callback)
 {
     // A stopped search opens nothing more.
     if (m_bStop.load()) {
         return;
     }
     try {
-        QVariantMap request = params;
-        request.insert(KEY_HUMAN_INFO, QStringLiteral("{}"));
-        request.insert(KEY_VEHICLE_INFO, QString());
-        request.insert(KEY_RULE_INFO, QString());
-        request.insert(KEY_DESCENDING, 1);
-        request.insert(KEY_DO_NOT_SORT, true);
-        const std::vector<float> body = toFloatVector(params.value(KEY_FEATURE));
-        const std::vector<float> face = toFloatVector(params.value(KEY_FACE_FEATURE));
-
         StoreSearch store(*m_tamsa);
-        if (getObjectMetaInfoFirst(request, &store.m_database, &store.m_search) != 0) {
+        if (openSearch(request, locations, &store.m_database, &store.m_search) != 0) {
             store.m_search = nullptr;
             return;
         }
@@ -543,10 +590,10 @@ void AttributeQueryWorker::partialReIdSearch(const QVariantMap& params, const Ca
             }
         }
     } catch (const std::exception& e) {
-        DELVIX_LOG(LogFacility::LevelError, "%s, search failed: %s",
-                   "AttributeQueryWorker::partialReIdSearch", e.what());
+        DELVIX_LOG(LogFacility::LevelError, "%s, search failed: %s", "AttributeQueryWorker::searchLocation",
+                   e.what());
     } catch (...) {
-        DELVIX_LOG(LogFacility::LevelError, "%s, search failed", "AttributeQueryWorker::partialReIdSearch");
+        DELVIX_LOG(LogFacility::LevelError, "%s, search failed", "AttributeQueryWorker::searchLocation");
     }
 }
 

@@ -105,6 +105,37 @@ public:
     void removeTamsaHandle();
 
 private:
+    // A request's conditions as the store query needs them, read once.
+    struct StoreRequest
+    {
+        qint64 startMs = 0;
+        qint64 endMs = 0;
+        std::string humanOther;
+        std::string humanPrimary;
+        std::string vehicleOther;
+        std::string vehiclePrimary;
+        bool loitering = false;
+        std::string trace;
+        uint32_t duration = 0;
+        int direction = 0;
+        std::vector<uint32_t> locations; // with the closing 0; empty when none remains
+        bool descending = false;
+        bool doNotSort = false;
+        std::string feature;
+        std::string faceFeature;
+        std::string plateNumber;
+    };
+    StoreRequest readRequest(const QVariantMap& params) const;
+    static std::vector<uint32_t> locationNumbers(const QStringList& locationIds);
+    // Initialises *database, then opens the search of request over locations.
+    long openSearch(const StoreRequest& request, const std::vector<uint32_t>& locations, void** database,
+                    void** search) const;
+    // What a re-identification asks the store for one location: people, no other condition.
+    static QVariantMap reIdStoreRequest(const QVariantMap& params);
+    void searchLocation(const StoreRequest& request, const std::vector<uint32_t>& locations,
+                        const std::vector<float>& body, const std::vector<float>& face,
+                        const Callback& callback);
+
     // Clears the stop flag and moves on to the next generation, under m_mutex.
     void finishSearch();
     void abortRegisteredSearches(); // REQUIRES: m_mutex held

@@ -524,7 +524,8 @@ TEST_F(WorkerTest, ReIdSearchesEveryLocationOnItsOwn)
             store->objects.push_back(object);
         }
     }
-    QVariantMap params = request({"Loc2", "Loc1", "Loc3"});
+    // An empty entry leaves no location: no store search for it, the others go on.
+    QVariantMap params = request({"Loc2", "", "Loc1", "Loc3"});
 
     // Serial: grouped by location, in list order, all on the calling thread.
     worker.setParallel(false);
@@ -554,13 +555,21 @@ TEST_F(WorkerTest, ReIdSearchesEveryLocationOnItsOwn)
     EXPECT_EQ(parallel.calls().back().thread, std::this_thread::get_id());
     EXPECT_NE(parallel.calls().front().thread, std::this_thread::get_id());
     EXPECT_EQ(store->openSearches(), 0);
-    EXPECT_EQ(store->releaseCount(), 6);
+    EXPECT_EQ(store->firstCount(), 6);
+    EXPECT_EQ(store->releaseCount(), 8);
 
     // No location: no store call, only the final call.
     SearchRecorder none;
     worker.reId(request({}), none.callback());
     EXPECT_TRUE(none.endsWithOneEmptyFinal());
-    EXPECT_EQ(store->initCount(), 6);
+    EXPECT_EQ(store->initCount(), 8);
+
+    // One location on its own: hits only, no final call.
+    SearchRecorder single;
+    worker.partialReIdSearch(request({"Loc3"}), single.callback());
+    EXPECT_EQ(single.finals(), 0);
+    ASSERT_EQ(single.hits().size(), 2u);
+    EXPECT_EQ(single.hits().front().value(KEY_LOC_ID).toString(), "Loc3");
 }
 
 TEST_F(WorkerTest, StopDuringReIdEndsEveryLocation)

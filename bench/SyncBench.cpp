@@ -58,9 +58,9 @@ void BM_SyncPass200Cameras(benchmark::State& state)
 {
     QTemporaryDir dir; // default settings: period 60 s, delay 180 s
     QDir::setCurrent(dir.path());
-    QList<CameraSpec> setups;
+    QList<CameraSetup> setups;
     for (int i = 0; i < kCameras; ++i) {
-        CameraSpec setup;
+        CameraSetup setup;
         setup.name = QStringLiteral("cam%1").arg(i, 3, 10, QLatin1Char('0'));
         setup.objectsPerMinute = 50;
         setup.protectedMetadata = i % 10 == 0; // every tenth camera asks for an access token

@@ -3,7 +3,7 @@
 
 #include <QString>
 
-struct CameraSpec
+struct CameraSetup
 {
     QString name;     // camera ID, the "Name" of its directory record
     quint16 port = 0; // 0: an ephemeral port; a fixed one for the cameras of a site file

@@ -14,7 +14,7 @@ CameraSimulator::~CameraSimulator()
     stop();
 }
 
-bool CameraSimulator::start(const QList<CameraSpec>& cameras, QString* error)
+bool CameraSimulator::start(const QList<CameraSetup>& cameras, QString* error)
 {
     stop();
     m_thread = std::make_unique<QThread>();
@@ -30,7 +30,7 @@ bool CameraSimulator::start(const QList<CameraSpec>& cameras, QString* error)
     QMetaObject::invokeMethod(
         m_context,
         [&]() {
-            for (CameraSpec setup : cameras) {
+            for (CameraSetup setup : cameras) {
                 if (setup.locationNumber == 0) {
                     setup.locationNumber = nextLocation;
                 }
@@ -142,7 +142,7 @@ QVariantMap CameraSimulator::directoryRecord(const QString& camera, int channel)
     if (!c) {
         return QVariantMap();
     }
-    const CameraSpec& setup = c->setup();
+    const CameraSetup& setup = c->setup();
     QVariantMap record;
     record.insert(QStringLiteral("Name"),
                   channel >= 0 ? setup.name + QStringLiteral("-c") + QString::number(channel) : setup.name);
@@ -166,7 +166,7 @@ QVariantMap CameraSimulator::directoryMap() const
 {
     QVariantMap map;
     for (SimulatedCamera* c : m_cameras) {
-        const CameraSpec& setup = c->setup();
+        const CameraSetup& setup = c->setup();
         if (setup.channels > 1) {
             for (int channel = 0; channel < setup.channels; ++channel) {
                 const QVariantMap record = directoryRecord(setup.name, channel);

@@ -15,7 +15,7 @@
 //   "IsRecording".
 // - Failures are values: start() returns false with a reason and leaves nothing listening.
 
-#include "CameraSpec.h"
+#include "CameraSetup.h"
 #include "ObjectGenerator.h"
 #include "Zelto.h"
 
@@ -39,7 +39,7 @@ public:
 
     // The cameras' clock for checking access tokens (default: the system clock). Set before start().
     void setClock(Zelto::Clock clock) { m_tokenOptions.clock = std::move(clock); }
-    bool start(const QList<CameraSpec>& cameras, QString* error = nullptr);
+    bool start(const QList<CameraSetup>& cameras, QString* error = nullptr);
     void stop();
 
     quint16 port(const QString& camera) const;

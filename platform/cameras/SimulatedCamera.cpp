@@ -81,7 +81,7 @@ QByteArray reason(int status)
 
 } // namespace
 
-SimulatedCamera::SimulatedCamera(const CameraSpec& setup, const ObjectGenerator* generator,
+SimulatedCamera::SimulatedCamera(const CameraSetup& setup, const ObjectGenerator* generator,
                                  Zelto::ManagerOptions tokenOptions,
                                  std::function<void(const ServedRequest&)> onServed, QObject* parent)
     : QAbstractHttpServer(parent)

@@ -2,7 +2,7 @@
 // One simulated camera: an HTTP(S) server on a loopback port serving the object-metadata and
 // pair-token paths. Lives on the simulator's thread; the switches may be set from any thread.
 
-#include "CameraSpec.h"
+#include "CameraSetup.h"
 #include "Zelto.h"
 
 #include <QAbstractHttpServer>
@@ -20,14 +20,14 @@ class SimulatedCamera : public QAbstractHttpServer
     Q_OBJECT
 
 public:
-    SimulatedCamera(const CameraSpec& setup, const ObjectGenerator* generator,
+    SimulatedCamera(const CameraSetup& setup, const ObjectGenerator* generator,
                     Zelto::ManagerOptions tokenOptions, std::function<void(const ServedRequest&)> onServed,
                     QObject* parent = nullptr);
 
     // Listens on 127.0.0.1 on an ephemeral port; false with a reason when it cannot.
     bool listenOnLoopback(QString* error);
     quint16 port() const { return m_port; }
-    const CameraSpec& setup() const { return m_setup; }
+    const CameraSetup& setup() const { return m_setup; }
 
     void setSlow(int delayMs) { m_slowMs = delayMs; }
     void setFailing(bool failing) { m_failing = failing; }
@@ -51,7 +51,7 @@ private:
     Answer challenge();
     void send(QTcpSocket* socket, const Answer& answer);
 
-    const CameraSpec m_setup;
+    const CameraSetup m_setup;
     const ObjectGenerator* m_generator; // owned by the simulator, outlives every camera
     const Zelto::ManagerOptions m_tokenOptions;
     const std::function<void(const ServedRequest&)> m_onServed;

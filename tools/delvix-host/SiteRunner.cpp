@@ -16,9 +16,9 @@ bool SiteRunner::start(const QString& storageDir, int objectsPerMinute, QString*
 {
     // One simulated camera per address; the site's ports are replaced by free ones so that
     // several hosts (and tests) can run side by side.
-    QMap<int, CameraSpec> byPort;
+    QMap<int, CameraSetup> byPort;
     for (const NovirCamera& camera : std::as_const(m_site.cameras)) {
-        CameraSpec& setup = byPort[camera.port];
+        CameraSetup& setup = byPort[camera.port];
         if (setup.name.isEmpty()) {
             setup.name = camera.name;
         }

@@ -48,16 +48,16 @@ class BraskHttpClientTest : public ::testing::Test
 protected:
     void SetUp() override
     {
-        CameraSpec basic;
+        CameraSetup basic;
         basic.name = QStringLiteral("basic");
         basic.password = QStringLiteral("s3cret");
-        CameraSpec digest = basic;
+        CameraSetup digest = basic;
         digest.name = QStringLiteral("digest");
         digest.digestAuth = true;
-        CameraSpec tls = basic;
+        CameraSetup tls = basic;
         tls.name = QStringLiteral("tls");
         tls.useSSL = true;
-        CameraSpec guarded = basic;
+        CameraSetup guarded = basic;
         guarded.name = QStringLiteral("guarded");
         guarded.protectedMetadata = true;
         QString error;

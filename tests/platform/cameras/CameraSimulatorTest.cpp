@@ -56,15 +56,15 @@ class CameraSimulatorTest : public ::testing::Test
 protected:
     void SetUp() override
     {
-        CameraSpec plain;
+        CameraSetup plain;
         plain.name = QStringLiteral("door");
         plain.objectsPerMinute = 50;
-        CameraSpec hall = plain;
+        CameraSetup hall = plain;
         hall.name = QStringLiteral("hall");
-        CameraSpec guarded = plain;
+        CameraSetup guarded = plain;
         guarded.name = QStringLiteral("vault");
         guarded.protectedMetadata = true;
-        CameraSpec multi = plain;
+        CameraSetup multi = plain;
         multi.name = QStringLiteral("yard");
         multi.channels = 2;
         ASSERT_TRUE(m_cameras.start({plain, hall, guarded, multi}));
@@ -246,7 +246,7 @@ TEST(CameraSimulatorPorts, FixedPortIsUsedAndATakenOneIsReported)
         ASSERT_TRUE(probe.listen(QHostAddress::LocalHost, 0));
         free = probe.serverPort();
     }
-    CameraSpec setup;
+    CameraSetup setup;
     setup.name = QStringLiteral("fixed");
     setup.port = free;
     CameraSimulator first;

@@ -24,9 +24,9 @@ bool waitFor(const std::function<bool()>& condition, int limitMs = 15000)
     return condition();
 }
 
-CameraSpec camera(const char* name)
+CameraSetup camera(const char* name)
 {
-    CameraSpec setup;
+    CameraSetup setup;
     setup.name = QString::fromLatin1(name);
     setup.password = QStringLiteral("pa:ss");
     setup.objectsPerMinute = 20;
@@ -41,10 +41,10 @@ TEST(CameraSyncIntegration, EveryHealthyCameraIsFetchedWhateverTheOthersDo)
     const QString previous = QDir::currentPath();
     QDir::setCurrent(dir.path());
 
-    CameraSpec vault = camera("vault");
+    CameraSetup vault = camera("vault");
     vault.protectedMetadata = true;
     vault.useSSL = true;
-    CameraSpec yard = camera("yard");
+    CameraSetup yard = camera("yard");
     yard.channels = 2;
     yard.digestAuth = true;
     CameraSimulator cameras;

@@ -39,9 +39,9 @@ TEST(DefaultSiteSync, EveryRecordingLocationOfTheSiteIsFetchedAndStored)
 
     // One simulated camera per address of the site (the two channels share one), on free ports.
     NovirSite site = NovirSite::defaultSite();
-    QMap<int, CameraSpec> byPort;
+    QMap<int, CameraSetup> byPort;
     for (const NovirCamera& camera : site.cameras) {
-        CameraSpec& setup = byPort[camera.port];
+        CameraSetup& setup = byPort[camera.port];
         if (setup.name.isEmpty()) {
             setup.name = camera.name;
         }
@@ -52,7 +52,7 @@ TEST(DefaultSiteSync, EveryRecordingLocationOfTheSiteIsFetchedAndStored)
         setup.objectsPerMinute = 600;
     }
     QSet<QString> protectedCameras;
-    for (const CameraSpec& setup : byPort) {
+    for (const CameraSetup& setup : byPort) {
         if (setup.protectedMetadata) {
             protectedCameras.insert(setup.name);
         }

@@ -53,7 +53,16 @@ function(delvix_test name)
   if(ARG_TIMEOUT)
     set(timeout ${ARG_TIMEOUT})
   endif()
-  gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST PROPERTIES TIMEOUT ${timeout})
+  # Instrumented builds run several times slower (ThreadSanitizer most), listing the tests included.
+  set(discovery 5)
+  if(DELVIX_SANITIZE STREQUAL "thread")
+    math(EXPR timeout "${timeout} * 4")
+    set(discovery 60)
+  elseif(DELVIX_SANITIZE STREQUAL "address")
+    math(EXPR timeout "${timeout} * 2")
+    set(discovery 60)
+  endif()
+  gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT ${discovery} PROPERTIES TIMEOUT ${timeout})
 endfunction()
 
 # delvix_bench(NAME SOURCES ... [LIBS ...]) builds a Google Benchmark executable (not a CTest test:

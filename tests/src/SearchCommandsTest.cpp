@@ -219,7 +219,7 @@ TEST_F(SearchCommandsTest, NodeIdIsAlwaysTheDirectorysAnswer)
 
 TEST_F(SearchCommandsTest, StopCommandsNeverReplyAndStopTheClientsSearch)
 {
-    addPeople(1000, 1, 2);
+    addPeople(1000, 1, 10); // a search of some seconds unless stopped
     for (const QString& stopCommand : {CMD_STOP_SEARCH, CMD_STOP_REID_SEARCH}) {
         ReplyRecorder running;
         plugin.Request(CMD_START_SEARCH, search({"Loc1"}), sender(&g_clientA), running.callback());

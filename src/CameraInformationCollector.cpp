@@ -48,31 +48,39 @@ quint64 readObjectId(const QJsonValue& value)
     }
 }
 
-// The info text goes into an XML element: a camera must not be able to end it early or
-// forge elements. Text without these characters stays byte-identical.
+// The info text goes into an XML element: a camera must not be able to end it early, forge
+// elements, or make the message unreadable. "&", "<" and ">" become entities; U+FFFE and U+FFFF,
+// which XML does not allow at all, can only stand inside JSON strings here and become their
+// JSON escapes, which read back as the same text. Text without any of these stays
+// byte-identical.
 QByteArray escapeXmlText(const QByteArray& text)
 {
+    auto isNonCharacter = [&text](qsizetype i) {
+        return quint8(text[i]) == 0xEF && i + 2 < text.size() && quint8(text[i + 1]) == 0xBF &&
+               (quint8(text[i + 2]) == 0xBE || quint8(text[i + 2]) == 0xBF);
+    };
     qsizetype extra = 0;
-    for (const char c : text) {
-        extra += c == '&' ? 4 : (c == '<' || c == '>') ? 3 : 0;
+    for (qsizetype i = 0; i < text.size(); ++i) {
+        const char c = text[i];
+        extra += c == '&' ? 4 : (c == '<' || c == '>') ? 3 : isNonCharacter(i) ? 3 : 0;
     }
     if (extra == 0) {
         return text;
     }
     QByteArray escaped;
     escaped.reserve(text.size() + extra);
-    for (const char c : text) {
-        switch (c) {
-        case '&':
+    for (qsizetype i = 0; i < text.size(); ++i) {
+        const char c = text[i];
+        if (c == '&') {
             escaped += "&amp;";
-            break;
-        case '<':
+        } else if (c == '<') {
             escaped += "&lt;";
-            break;
-        case '>':
+        } else if (c == '>') {
             escaped += "&gt;";
-            break;
-        default:
+        } else if (isNonCharacter(i)) {
+            escaped += quint8(text[i + 2]) == 0xBE ? "\\ufffe" : "\\uffff";
+            i += 2;
+        } else {
             escaped += c;
         }
     }

@@ -3,6 +3,7 @@
 #include "CameraInformationCollector.h"
 #include "IFrameworkTools.h"
 #include "NOVIRImplementation/ScriptedTunnelClient.h"
+#include "Quellon.h"
 
 #include <QJsonDocument>
 #include <QSignalSpy>
@@ -294,6 +295,21 @@ TEST_F(CollectorTest, WriteDataKeepsTextSafeAndIntact)
     collector->writeData(2, 3, clean);
     EXPECT_EQ(infoOf(sentMetaInfo()->info.strContent).toUtf8(),
               QJsonDocument::fromJson(clean.toUtf8()).toJson(QJsonDocument::Compact));
+
+    // Characters XML does not allow at all go out as their JSON escapes: same text, readable XML.
+    const QString nonCharacters =
+        QStringLiteral("{\"ObjectMetaInfo\":[{\"ID\":1,\"N\":\"a\uFFFFb\uFFFE\"}]}");
+    collector->writeData(2, 3, nonCharacters);
+    const QString sentText = sentMetaInfo()->info.strContent;
+    EXPECT_EQ(infoOf(sentText), QStringLiteral(R"({"ObjectMetaInfo":[{"ID":1,"N":"a\uffffb\ufffe"}]})"));
+    Quellon quellon;
+    const QString readBack = quellon.parse(sentText)
+                                 .toMap()
+                                 .value(QStringLiteral("InputObjectMetaInfo"))
+                                 .toMap()
+                                 .value(QStringLiteral("Info"))
+                                 .toString();
+    EXPECT_EQ(QJsonDocument::fromJson(readBack.toUtf8()), QJsonDocument::fromJson(nonCharacters.toUtf8()));
 
     // An object without ID (or not an object at all) reads as 0 and goes out with ID null.
     collector->writeData(2, 3, QStringLiteral(R"({"ObjectMetaInfo":[{"ID":4},{"X":1},7]})"));

@@ -7,6 +7,7 @@
 
 #include <QMetaObject>
 #include <QRandomGenerator64>
+#include <algorithm>
 #include <exception>
 #include <mutex>
 
@@ -16,21 +17,6 @@ struct CommandEntry
 {
     const QString& strCommand;
     PluginDelvixSrv::CommandHandler handler;
-};
-
-// The reply callback of an add batch, carrying the vault the batch's case lives in, so that
-// the final step writes the items where their case is even when the path changed meanwhile.
-struct BatchReply
-{
-    HDLR_DO_REQUEST_CB client;
-    std::shared_ptr<CaseDatabase> pCaseDatabase;
-    void operator()(bool bFinal, const QString& strCode, const QString& strMessage,
-                    const QVariant& payload) const
-    {
-        if (client) {
-            client(bFinal, strCode, strMessage, payload);
-        }
-    }
 };
 
 // State of one add batch, shared by its per-item callbacks and released with the last of them.
@@ -44,6 +30,31 @@ struct AddBatch
 };
 
 } // namespace
+
+// An add batch that has not given its final reply yet. Whoever sets answered first gives it:
+// the batch's final step, or the destructor when the plug-in goes first.
+struct PluginDelvixSrv::OpenBatch
+{
+    std::atomic<bool> answered{false};
+    HDLR_DO_REQUEST_CB client;
+};
+
+// The reply callback of an add batch. It carries the vault the batch's case lives in, so the
+// final step writes the items where their case is even when the path changed meanwhile, and
+// the batch's open entry, so that the batch is answered exactly once.
+struct PluginDelvixSrv::BatchReply
+{
+    HDLR_DO_REQUEST_CB client;
+    std::shared_ptr<CaseDatabase> pCaseDatabase;
+    std::shared_ptr<OpenBatch> pOpen;
+    void operator()(bool bFinal, const QString& strCode, const QString& strMessage,
+                    const QVariant& payload) const
+    {
+        if (client) {
+            client(bFinal, strCode, strMessage, payload);
+        }
+    }
+};
 
 PluginDelvixSrv::PluginDelvixSrv()
     : IPluginObjectBase(nullptr)
@@ -62,6 +73,17 @@ PluginDelvixSrv::~PluginDelvixSrv()
         // Late bookmark answers find the guard empty and leave this object alone.
         std::lock_guard<std::mutex> lock(m_pLifeGuard->mutex);
         m_pLifeGuard->pPlugin = nullptr;
+    }
+    // Batches still waiting for bookmarks get their final answer now, and store nothing.
+    std::vector<std::shared_ptr<OpenBatch>> openBatches;
+    {
+        std::lock_guard<std::mutex> lock(m_openBatchesMutex);
+        openBatches.swap(m_openBatches);
+    }
+    for (const std::shared_ptr<OpenBatch>& pOpen : openBatches) {
+        if (!pOpen->answered.exchange(true)) {
+            reply(pOpen->client, RC_FAILURE, QVariant());
+        }
     }
     setCaseDatabase(nullptr);
     // The retriever goes before the collector: its running search still looks up cameras
@@ -626,7 +648,13 @@ void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
     }
     auto batch = std::make_shared<AddBatch>();
     batch->total = int(caseItemList.size());
-    batch->reply = BatchReply{std::move(hdlrDoRequestCB), std::move(pCaseDatabase)};
+    auto pOpen = std::make_shared<OpenBatch>();
+    pOpen->client = hdlrDoRequestCB;
+    {
+        std::lock_guard<std::mutex> lock(m_openBatchesMutex);
+        m_openBatches.push_back(pOpen);
+    }
+    batch->reply = BatchReply{std::move(hdlrDoRequestCB), std::move(pCaseDatabase), pOpen};
     const std::shared_ptr<LifeGuard> pLifeGuard = m_pLifeGuard;
 
     for (const QVariant& element : caseItemList) {
@@ -638,7 +666,7 @@ void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
         // Counts the first answer of its item only: a bookmark plug-in that answers twice must
         // neither count twice nor end the batch a second time.
         auto answered = std::make_shared<std::atomic<bool>>(false);
-        HDLR_DO_REQUEST_CB itemCallback = [pLifeGuard, batch, item, relay,
+        HDLR_DO_REQUEST_CB itemCallback = [pLifeGuard, batch, pOpen, item, relay,
                                            answered](bool, const QString& strCode, const QString&,
                                                      const QVariant& payload) {
             if (answered->exchange(true)) {
@@ -656,7 +684,7 @@ void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
                 }
                 bOk = true;
             }
-            if (batch->reply) {
+            if (batch->reply && !pOpen->answered.load()) {
                 batch->reply(false, RC_SUCCESS, QString(), QVariant());
             }
             std::lock_guard<std::mutex> lock(batch->mutex);
@@ -695,12 +723,20 @@ void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
 void PluginDelvixSrv::addCaseItem(const QString& returnCode, const QList<QVariant>& caseItemList,
                                   HDLR_DO_REQUEST_CB hdlrDoRequestCB) const
 {
+    const BatchReply* pBatchReply = hdlrDoRequestCB.target<BatchReply>();
+    if (pBatchReply && pBatchReply->pOpen) {
+        if (pBatchReply->pOpen->answered.exchange(true)) {
+            return; // answered already, at shutdown
+        }
+        std::lock_guard<std::mutex> lock(m_openBatchesMutex);
+        m_openBatches.erase(std::remove(m_openBatches.begin(), m_openBatches.end(), pBatchReply->pOpen),
+                            m_openBatches.end());
+    }
     if (caseItemList.isEmpty()) {
         reply(hdlrDoRequestCB, returnCode, QVariant());
         return;
     }
     // The vault the batch started on; a batch reply made elsewhere uses the current one.
-    const BatchReply* pBatchReply = hdlrDoRequestCB.target<BatchReply>();
     const std::shared_ptr<CaseDatabase> pCaseDatabase =
         pBatchReply && pBatchReply->pCaseDatabase ? pBatchReply->pCaseDatabase : caseDatabase();
     if (!pCaseDatabase) {

@@ -21,6 +21,7 @@
 #include <atomic>
 #include <memory>
 #include <mutex>
+#include <vector>
 
 class PluginDelvixSrv : public IPluginObjectBase
 {
@@ -172,6 +173,11 @@ private:
     QSharedPointer<ICameraInformationCollector> m_pCameraInformationCollector;
     IPluginManager* m_pPluginManager = nullptr; // host object, not owned
     IRelaySender* m_pRelaySender = nullptr;     // host object, not owned
+    struct OpenBatch;
+    struct BatchReply;
+    mutable std::mutex m_openBatchesMutex;                         // guards m_openBatches
+    mutable std::vector<std::shared_ptr<OpenBatch>> m_openBatches; // batches without their final reply
+
     // Lets answers that arrive on other threads after destruction find that the plug-in is gone.
     struct LifeGuard
     {

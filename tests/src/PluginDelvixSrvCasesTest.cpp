@@ -353,22 +353,34 @@ TEST_F(PluginCasesTest, EmptyBatchSendsNothingAndDoubleAnswersCountOnce)
     EXPECT_EQ(vault().getCaseItemList(recorder.last().payload.toMap().value(KEY_CASE_ID).toInt()).size(), 2);
 }
 
-TEST_F(PluginCasesTest, AnswersAfterThePluginIsGoneAreIgnored)
+TEST_F(PluginCasesTest, UnloadAnswersWaitingBatchesOnceAndLateAnswersAreIgnored)
 {
     HoldingBookmarkPlugin holding;
     m_manager.registerPluginObject(PLUGIN_ID_BOOKMARK, &holding);
     ReplyRecorder recorder;
-    m_plugin->Request(
-        CMD_ADD_CASE_WITH_ITEM,
-        QVariantMap{{KEY_CASE_NAME, QStringLiteral("c")}, {KEY_CASE_ITEM, item(QStringLiteral("c1"), true)}},
-        m_sender, recorder.callback());
-    ASSERT_EQ(holding.callbacks.size(), 1);
+    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS,
+                      QVariantMap{{KEY_CASE_NAME, QStringLiteral("c")},
+                                  {KEY_CASE_ITEM, QVariantList{item(QStringLiteral("c1"), true),
+                                                               item(QStringLiteral("c2"), true)}}},
+                      m_sender, recorder.callback());
+    ASSERT_EQ(holding.callbacks.size(), 2);
+    holding.callbacks[0](true, RC_SUCCESS, QString(),
+                         QVariantMap{{KEY_BM_BOOKMARK_ID, QStringLiteral("b1")}});
+    ASSERT_EQ(recorder.replies().size(), 1u); // one progress reply; the batch still waits
+
+    // The plug-in goes while the batch waits: the client gets its final answer now.
     m_plugin.reset();
-    holding.callbacks.first()(true, RC_SUCCESS, QString(),
-                              QVariantMap{{KEY_BM_BOOKMARK_ID, QStringLiteral("b")}});
+    ASSERT_EQ(recorder.finalCount(), 1);
+    EXPECT_EQ(recorder.last().strCode, RC_FAILURE);
+
+    // The late answer neither replies again nor writes anything.
+    holding.callbacks[1](true, RC_SUCCESS, QString(),
+                         QVariantMap{{KEY_BM_BOOKMARK_ID, QStringLiteral("b2")}});
     QCoreApplication::processEvents();
-    EXPECT_EQ(recorder.finalCount(), 0);
-    EXPECT_EQ(recorder.replies().size(), 1u); // the progress reply only
+    EXPECT_EQ(recorder.replies().size(), 2u);
+    const QVariantList cases = vault().getAllCase();
+    ASSERT_EQ(cases.size(), 1);
+    EXPECT_TRUE(vault().getCaseItemList(cases[0].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
 }
 
 TEST_F(PluginCasesTest, CaseCommandsGuardTheData)

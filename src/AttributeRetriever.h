@@ -5,9 +5,9 @@
 // callback. A stop cancels a queued task (which then gets its final callback) or ends the
 // running one.
 //
-// The thread runs while tasks remain and ends when it finds the queue empty; the destructor
-// cancels what is queued, stops what runs and waits for the thread, so nothing outlives the
-// worker it uses.
+// The thread runs while tasks remain and ends when it finds the queue empty. The destructor
+// cancels what is queued (each task gets its final callback), stops what runs and waits for
+// the thread; called on that thread itself, it leaves the thread to end on its own.
 
 #include "AttributeQueryWorker.h"
 

@@ -34,7 +34,8 @@ public:
     explicit NovirConfigServer(const NovirSite& site, QObject* parent = nullptr);
     ~NovirConfigServer() override;
 
-    // Opens the store under storageDir for "InputObjectMetaInfo". False with a reason otherwise.
+    // Opens the store under storageDir for "InputObjectMetaInfo"; call it before start(), the
+    // store is then used on the server thread only. False with a reason otherwise.
     bool openStore(const QString& storageDir, QString* error);
     // Starts the thread and brings both servers up (kinds 1 and 4).
     void start();

@@ -307,16 +307,6 @@ void PluginDelvixSrv::UnsubscribeEventBlock(const QString&, const QVariant&, IRe
     DELVIX_SCOPE_TRACE("PluginDelvixSrv::UnsubscribeEventBlock");
 }
 
-void PluginDelvixSrv::replyNotAvailable(const char* strCommand,
-                                        const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const
-{
-    DELVIX_LOG(LogFacility::LevelError, "%s, command %s is not available yet", "PluginDelvixSrv::Request",
-               strCommand);
-    if (hdlrDoRequestCB) {
-        hdlrDoRequestCB(true, RC_FAILURE, QString(), QVariant());
-    }
-}
-
 void PluginDelvixSrv::setEnableDelvix(const QVariantMap& delvixSettings)
 {
     m_bEnableDelvix = delvixSettings.value(QStringLiteral("enable")).toBool();

@@ -164,8 +164,6 @@ private:
     static QList<QVariant> withCaseId(const QList<QVariant>& caseItemList, int caseId);
     static HDLR_RELAY_RESPONSE_CB relayResponse(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
 
-    // Answer of a command whose handler is not built yet: (true, "-1", "", none), logged.
-    void replyNotAvailable(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
 
     // Created and used on the plug-in's thread; request threads only hand work over to it.
     QSharedPointer<CameraSynchronizer> m_cameraSynchronizer;

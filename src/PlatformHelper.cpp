@@ -9,6 +9,7 @@
 #include <QThread>
 
 #include <ctime>
+#include <mutex>
 #include <vector>
 
 #if defined(Q_OS_WIN)
@@ -16,6 +17,19 @@
 #else
 #include <dlfcn.h>
 #endif
+
+namespace {
+
+// Serialises the calls here that touch process-wide state of the C library (the time zone,
+// which tzset rewrites and QSettings reads too): the library's own lock is invisible to race
+// detectors, and several search threads come here at once.
+std::mutex& processStateMutex()
+{
+    static std::mutex mutex;
+    return mutex;
+}
+
+} // namespace
 
 void* PlatformHelper::loadLibrary(const char* windowsFileName)
 {
@@ -105,6 +119,9 @@ QVariant PlatformHelper::readMachineSetting(const QString& strKeyPath, const QSt
     const QString application = parts.takeLast();
     const QString organisation = parts.takeLast();
     parts.removeFirst(); // the hive
+    // Every store connection reads the value, from several search threads at once, and
+    // QSettings consults the C library's time zone (see localZone).
+    std::lock_guard<std::mutex> lock(processStateMutex());
     QSettings settings(QSettings::NativeFormat, QSettings::SystemScope, organisation, application);
     const QString group = parts.join(QLatin1Char('/'));
     const QString key = group.isEmpty() ? strName : group + QLatin1Char('/') + strName;
@@ -135,8 +152,10 @@ PlatformHelper::LocalZone PlatformHelper::localZone()
 #else
     // POSIX has no "standard bias" call: take the offset of a moment of this year that is not
     // in daylight saving time (January or July, whichever hemisphere). localtime_r, unlike
-    // localtime, is safe from the re-identification threads that ask at the same time; tzset
-    // makes a changed TZ count, as a changed Windows zone does.
+    // localtime, keeps its result to the caller; tzset makes a changed TZ count, as a changed
+    // Windows zone does. tzset rewrites the C library's zone state, and the re-identification
+    // threads all ask at once: one caller at a time, under a lock every tool can see.
+    std::lock_guard<std::mutex> lock(processStateMutex());
     tzset();
     const time_t now = std::time(nullptr);
     std::tm local = {};

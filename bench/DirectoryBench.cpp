@@ -14,7 +14,7 @@
 namespace {
 
 // Accepts every request, keeps the last content's size and the all-cameras callback.
-class SinkClient : public INovirTunnelClient
+class SinkClient final : public INovirTunnelClient
 {
 public:
     qsizetype lastContentSize = 0;
@@ -55,7 +55,7 @@ public:
     NSNovirTunnelClient::ConnectStatusHandler connect;
 };
 
-class SinkTools : public IFrameworkTools
+class SinkTools final : public IFrameworkTools
 {
 public:
     explicit SinkTools(INovirTunnelClient* client)

@@ -16,7 +16,7 @@
 
 namespace {
 
-class FuzzTools : public IFrameworkTools
+class FuzzTools final : public IFrameworkTools
 {
 public:
     explicit FuzzTools(INovirTunnelClient* client)

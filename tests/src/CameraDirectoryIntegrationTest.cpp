@@ -15,7 +15,7 @@
 
 namespace {
 
-class SimulatorTools : public IFrameworkTools
+class SimulatorTools final : public IFrameworkTools
 {
 public:
     explicit SimulatorTools(INovirTunnelClient* client)

@@ -15,7 +15,7 @@
 
 namespace {
 
-class FakeTools : public IFrameworkTools
+class FakeTools final : public IFrameworkTools
 {
 public:
     explicit FakeTools(INovirTunnelClient* client)

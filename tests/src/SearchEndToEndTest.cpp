@@ -1,6 +1,7 @@
 // Both searches through Request over the real store library, seeded with synthetic camera
 // answers, found the way production finds it: through the machine setting "INSTALL_PATH".
 #include "DelvixKeys.h"
+#include "ICameraInformationCollector.h"
 #include "PluginDelvixSrv.h"
 #include "Tamsa.h"
 #include "TamsaSeeder.h"
@@ -23,6 +24,18 @@
 namespace {
 
 int g_client = 0;
+
+// The camera directory is not what these tests are about: a fixed one, location n on camera-n.
+class FixedDirectory : public ICameraInformationCollector
+{
+public:
+    void writeData(int, int, const QString&) override {}
+    void setDelvixSettings(const QVariantMap&) override {}
+    QString getCameraNodeID(const QString& location) override
+    {
+        return QString(location).replace(QStringLiteral("Loc"), QStringLiteral("camera-"));
+    }
+};
 
 class Replies
 {
@@ -100,7 +113,11 @@ protected:
         s_data = nullptr;
     }
 
-    void SetUp() override { plugin.InitialPluginBase(nullptr); }
+    void SetUp() override
+    {
+        plugin.setCameraInformationCollector(QSharedPointer<FixedDirectory>::create());
+        plugin.InitialPluginBase(nullptr);
+    }
 
     std::vector<QVariantMap> run(const QString& command, const QVariantMap& params)
     {
@@ -148,7 +165,7 @@ TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrder)
     std::set<qulonglong> ids;
     for (const QVariantMap& hit : hits) {
         EXPECT_EQ(hit.value(KEY_LOC_ID).toString(), "Loc2");
-        EXPECT_TRUE(hit.contains(KEY_NODE_ID));
+        EXPECT_EQ(hit.value(KEY_NODE_ID).toString(), "camera-2");
         EXPECT_GE(hit.value(KEY_START_TIMESTAMP).toLongLong(), previous);
         previous = hit.value(KEY_START_TIMESTAMP).toLongLong();
         EXPECT_FALSE(hit.value(KEY_OBJ_IMAGE).toString().isEmpty());

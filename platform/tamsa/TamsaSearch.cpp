@@ -69,11 +69,13 @@ TamsaSearch::TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQu
 
 TamsaSearch::~TamsaSearch()
 {
+    // The handler goes first: finalizing the last statement of a connection already closed by
+    // a caller that broke the order frees the connection.
+    sqlite3_progress_handler(m_db, 0, nullptr, nullptr);
     for (Cursor& cursor : m_cursors) {
         sqlite3_finalize(cursor.statement);
     }
     sqlite3_finalize(m_byRowId);
-    sqlite3_progress_handler(m_db, 0, nullptr, nullptr);
 }
 
 int32_t TamsaSearch::next(TTAMSA_OBJECTMETAINFO_RESULT* result)

@@ -4,6 +4,7 @@
 #include <atomic>
 #include <chrono>
 #include <csignal>
+#include <random>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
@@ -135,6 +136,64 @@ TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
     record[0] = 0;
     EXPECT_EQ(Tamsa_InitDatabase(&unset, record, 0), TAMSA_E_INVALID_ARGUMENT);
     EXPECT_EQ(unset, nullptr);
+}
+
+TEST_F(TamsaLifecycleTest, MutatedAnswersAndQueriesAreRefusedOrStoredNeverCrash)
+{
+    ObjectSpec person;
+    person.attributes = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5]})";
+    person.trajectory = {{0.1, 0.2}, {0.3, 0.4}};
+    person.body = randomUnitVector(1);
+    person.face = randomUnitVector(2);
+    ObjectSpec car;
+    car.id = 2;
+    car.type = "Vehicle";
+    car.plateCrop = "AB-12";
+    const std::string valid = answerJson({person, car});
+    std::mt19937 random(77);
+    const char alphabet[] = "{}[]\",:0123456789.eE-+ntrufalsxyzIDN\\u\x01";
+    int stored = 0;
+    for (int round = 0; round < 400; ++round) {
+        std::string text = valid;
+        const int edits = 1 + int(random() % 8);
+        for (int e = 0; e < edits; ++e) {
+            const size_t at = random() % text.size();
+            switch (random() % 3) {
+            case 0:
+                text[at] = alphabet[random() % (sizeof alphabet - 1)];
+                break;
+            case 1:
+                text.insert(at, 1, alphabet[random() % (sizeof alphabet - 1)]);
+                break;
+            default:
+                text.erase(at, 1 + random() % 20);
+            }
+        }
+        const int32_t result = putText(1 + round % 3, text);
+        EXPECT_TRUE(result >= 0 || result == TAMSA_E_BAD_JSON) << result;
+        stored += result > 0 ? result : 0;
+
+        QuerySpec spec; // the same text as every query field
+        spec.locations = {1, 2, 3};
+        const std::string fragment = text.substr(random() % text.size(), 40);
+        switch (round % 4) {
+        case 0:
+            spec.primary = fragment;
+            break;
+        case 1:
+            spec.trace = fragment;
+            break;
+        case 2:
+            spec.feature = fragment;
+            break;
+        default:
+            spec.plate = fragment;
+        }
+        int32_t status = 0;
+        search(spec, &status);
+        EXPECT_TRUE(status == TAMSA_E_NO_MORE_RECORDS || status == TAMSA_E_BAD_QUERY) << status;
+    }
+    EXPECT_GT(stored, 0) << "some mutations leave valid objects";
 }
 
 TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)

@@ -1,6 +1,10 @@
 // Ingest, durability, and the thread rules: Abort from another thread, handles used at once.
 #include "TamsaTestStore.h"
 
+#include <QJsonArray>
+#include <QJsonDocument>
+#include <QJsonObject>
+
 #include <atomic>
 #include <chrono>
 #include <csignal>
@@ -194,6 +198,26 @@ TEST_F(TamsaLifecycleTest, MutatedAnswersAndQueriesAreRefusedOrStoredNeverCrash)
         EXPECT_TRUE(status == TAMSA_E_NO_MORE_RECORDS || status == TAMSA_E_BAD_QUERY) << status;
     }
     EXPECT_GT(stored, 0) << "some mutations leave valid objects";
+
+    // Control characters sent escaped stay text; they cannot pose as the store's vector markers.
+    ObjectSpec tricky;
+    tricky.id = 99;
+    tricky.body = randomUnitVector(99);
+    std::string answer = answerJson({tricky});
+    answer.replace(answer.find("aW1hZ2U"), 7, "\\u0001\\u0002");
+    ASSERT_EQ(putText(9, answer), 1);
+    QuerySpec spec;
+    spec.locations = {9};
+    const std::vector<ResultCopy> results = search(spec);
+    ASSERT_EQ(results.size(), 1u);
+    const QJsonObject thumbnail = QJsonDocument::fromJson(QByteArray::fromStdString(results[0].thumbnails))
+                                      .object()
+                                      .value("Thumbnail")
+                                      .toArray()
+                                      .at(0)
+                                      .toObject();
+    EXPECT_TRUE(thumbnail.value("image").toString().startsWith(QString::fromUtf8("\x01\x02")));
+    EXPECT_EQ(thumbnail.value("feature").toArray().size(), 512);
 }
 
 TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)

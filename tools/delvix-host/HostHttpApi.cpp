@@ -3,6 +3,7 @@
 #include "HostCommand.h"
 #include "PluginHost.h"
 
+#include <QDir>
 #include <QHttpServerRequest>
 #include <QJsonDocument>
 #include <QJsonObject>
@@ -89,6 +90,11 @@ bool HostHttpApi::handleRequest(const QHttpServerRequest& request, QTcpSocket* s
         return true;
     }
 
+    if (path == QLatin1String("/host/databasePath")) {
+        changeDatabasePath(request.body(), socket);
+        return true;
+    }
+
     QString command;
     QVariant params;
     QString client = QUrlQuery(request.url()).queryItemValue(QStringLiteral("client"));
@@ -129,6 +135,25 @@ bool HostHttpApi::handleRequest(const QHttpServerRequest& request, QTcpSocket* s
     }
     dispatch(socket, command, params, client, qBound(0.0, waitSeconds, 3600.0));
     return true;
+}
+
+void HostHttpApi::changeDatabasePath(const QByteArray& body, QTcpSocket* socket)
+{
+    const QJsonObject object = QJsonDocument::fromJson(body).object();
+    const QString path = object.value(QStringLiteral("path")).toString();
+    if (path.isEmpty()) {
+        writeSimple(socket, 400, "text/plain", "the body must be {\"path\": FOLDER}\n");
+        return;
+    }
+    // The server makes its database folder before it announces it, as the host does at start;
+    // the plug-in then moves its vault there.
+    if (!QDir().mkpath(path)) {
+        writeSimple(socket, 400, "text/plain", "cannot make the folder " + path.toUtf8() + '\n');
+        return;
+    }
+    m_host->serverInfo().setServerDatabasePath(QDir(path).absolutePath());
+    const QJsonObject answer{{QStringLiteral("path"), m_host->serverInfo().serverDatabasePath()}};
+    writeSimple(socket, 200, "application/json", QJsonDocument(answer).toJson(QJsonDocument::Compact) + '\n');
 }
 
 void* HostHttpApi::senderHandle(const QString& client)

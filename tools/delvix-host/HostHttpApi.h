@@ -5,6 +5,9 @@
 //   POST /request   body {"command": NAME, "params": VALUE, "client": NAME, "wait": SECONDS}
 //   POST /NAME      body VALUE (the parameter), client from ?client=NAME or the X-Client header
 //   GET  /health    {"ok": true}
+//   POST /host/databasePath   body {"path": FOLDER}: makes the folder and moves the server
+//                   database path (and with it the case vault) there, the way the management
+//                   server does; answers {"path": FOLDER}
 //
 // The answer is 200 with Content-Type application/x-ndjson in chunked transfer encoding: one
 // line {"final", "code", "message", "payload"} per reply, as it arrives; the body ends with the
@@ -42,6 +45,7 @@ protected:
 private:
     void dispatch(QTcpSocket* socket, const QString& command, const QVariant& params, const QString& client,
                   double waitSeconds);
+    void changeDatabasePath(const QByteArray& body, QTcpSocket* socket);
     void* senderHandle(const QString& client);
     static void writeSimple(QTcpSocket* socket, int status, const QByteArray& contentType,
                             const QByteArray& body);

@@ -1,9 +1,9 @@
 // delvix-host serve: the long-running host with the local HTTP API (HostHttpApi.h), on the
-// built-in site or a site file, until interrupted.
+// built-in site or a site file (its cameras simulated on free loopback ports), until interrupted.
 #include "HostCommand.h"
 #include "HostHttpApi.h"
-#include "NovirConfigServer.h"
 #include "PluginHost.h"
+#include "SiteRunner.h"
 
 #include <QCoreApplication>
 #include <QDir>
@@ -68,14 +68,15 @@ int runServe(QStringList args)
         std::fprintf(stderr, "delvix-host serve: %s\n", qUtf8Printable(error));
         return 1;
     }
-    // Declared before the host: the plug-in's handlers must never outlive the server.
-    NovirConfigServer server(site);
-    if (!server.openStore(QDir(options.dataDir).filePath(QStringLiteral("Server")), &error)) {
-        std::fprintf(stderr, "delvix-host serve: metadata will not be stored: %s\n", qUtf8Printable(error));
+    // Declared before the host: the plug-in's handlers must never outlive the server. The
+    // cameras run too, so that the synchroniser has real answers to fetch.
+    SiteRunner runner(site);
+    if (!runner.start(QDir(options.dataDir).filePath(QStringLiteral("Server")), 6, &error)) {
+        std::fprintf(stderr, "delvix-host serve: the site did not start: %s\n", qUtf8Printable(error));
+        return 1;
     }
-    server.start();
     PluginHost host(options.dataDir);
-    host.setNovirTunnelClient(&server);
+    host.setNovirTunnelClient(&runner.server());
     const QString module =
         options.modulePath.isEmpty() ? PluginHost::defaultModulePath() : options.modulePath;
     if (!host.load(module, &error)) {

@@ -552,6 +552,9 @@ QByteArray generatedSite(int cameras)
         // Distinct ports make distinct simulated cameras; the runner replaces them with free ones.
         list.append(QJsonObject{{QStringLiteral("name"), QStringLiteral("Cam%1").arg(i)},
                                 {QStringLiteral("port"), 20000 + i},
+                                // Cameras answer only with credentials.
+                                {QStringLiteral("user"), QStringLiteral("admin")},
+                                {QStringLiteral("password"), QStringLiteral("cam-%1-pw").arg(i)},
                                 {QStringLiteral("location"), QStringLiteral("Loc%1").arg(i)},
                                 {QStringLiteral("groupId"), 1 + i % 4}});
     }
@@ -691,7 +694,8 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
                               {QStringLiteral("locIDList"), QJsonArray::fromStringList(siteLocations)}}}});
     waitFor({syncAnswer});
     const qsizetype synchronisedHits = std::max<qsizetype>(0, syncAnswer->lines.size() - 1);
-    EXPECT_GT(synchronisedHits, 0) << "nothing the cameras recorded during the run was found";
+    EXPECT_GT(synchronisedHits, 0) << "nothing the cameras recorded during the run was found; see "
+                                   << qPrintable(QDir(dataDir).filePath(QStringLiteral("serve.log")));
 
     const qint64 endRssKb = procStatusKb(pid, "VmRSS");
     const qint64 peakRssKb = procStatusKb(pid, "VmHWM");
@@ -776,4 +780,8 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     // Flat memory, with room for caches and allocator slack: no steady growth with the requests.
     EXPECT_LT(endRssKb, std::max(settledRssKb * 2, settledRssKb + 256 * 1024))
         << "server memory grew from " << settledRssKb << " kB to " << endRssKb << " kB";
+    if (::testing::Test::HasFailure()) {
+        data.setAutoRemove(false); // the server's log and both vaults, for a look
+        std::printf("  data folder kept: %s\n", qPrintable(dataDir));
+    }
 }

@@ -7,30 +7,85 @@
 namespace {
 
 // One open element while reading. Children are collected per name in lists so that repeated
-// elements are appended in place; the map is built once, when the element closes.
+// elements are appended in place; the map is built once, when the element closes. Most elements
+// have a handful of distinct child names, searched in order; past kIndexedNames a hash takes over
+// so that hostile inputs with many names stay linear.
 struct Frame
 {
+    static constexpr size_t kIndexedNames = 16;
+
     QString name;
     QString text;
-    QHash<QString, QVariantList> children;
+    std::vector<std::pair<QString, QVariantList>> children;
+    QHash<QString, size_t> index; // name -> position in children, once there are many
+
+    QVariantList& childList(const QString& childName)
+    {
+        if (children.size() <= kIndexedNames) {
+            for (auto& child : children) {
+                if (child.first == childName) {
+                    return child.second;
+                }
+            }
+        } else {
+            const auto it = index.constFind(childName);
+            if (it != index.cend()) {
+                return children[it.value()].second;
+            }
+        }
+        children.emplace_back(childName, QVariantList());
+        if (children.size() > kIndexedNames) {
+            if (index.isEmpty()) {
+                for (size_t i = 0; i < children.size(); ++i) {
+                    index.insert(children[i].first, i);
+                }
+            } else {
+                index.insert(childName, children.size() - 1);
+            }
+        }
+        return children.back().second;
+    }
 };
 
 QVariant closeFrame(Frame& frame)
 {
-    if (frame.children.isEmpty()) {
+    if (frame.children.empty()) {
         return QVariant(std::move(frame.text));
     }
     QVariantMap map;
-    for (auto it = frame.children.begin(); it != frame.children.end(); ++it) {
-        QVariantList& occurrences = it.value();
+    for (auto& child : frame.children) {
+        QVariantList& occurrences = child.second;
         if (occurrences.size() == 1) {
-            map.insert(it.key(), std::move(occurrences.first()));
+            map.insert(child.first, std::move(occurrences.first()));
         } else {
-            map.insert(it.key(), QVariant(std::move(occurrences)));
+            map.insert(child.first, QVariant(std::move(occurrences)));
         }
     }
     return QVariant(std::move(map));
 }
+
+// Element names repeat all through an answer; sharing one QString per name saves an allocation
+// per element. Bounded, so that a hostile input with endless names costs no more than without.
+class NameCache
+{
+public:
+    QString get(QStringView name)
+    {
+        for (const QString& known : m_names) {
+            if (known == name) {
+                return known;
+            }
+        }
+        QString created = name.toString();
+        if (m_names.size() < 64) {
+            m_names.push_back(created);
+        }
+        return created;
+    }
+
+private:
+    std::vector<QString> m_names;
+};
 
 } // namespace
 
@@ -44,6 +99,7 @@ QVariant Quellon::parse(const QString& xml)
     reader.setEntityExpansionLimit(1024);
 
     std::vector<Frame> stack;
+    NameCache names;
     QVariantMap root;
     bool rootClosed = false;
     qsizetype elementCount = 0;
@@ -54,7 +110,7 @@ QVariant Quellon::parse(const QString& xml)
             if (rootClosed || stack.size() >= size_t(kMaxDepth) || ++elementCount > kMaxElements) {
                 return QVariant();
             }
-            stack.push_back(Frame{reader.qualifiedName().toString(), QString(), {}});
+            stack.push_back(Frame{names.get(reader.qualifiedName()), QString(), {}, {}});
             break;
         case QXmlStreamReader::EndElement: {
             if (stack.empty()) {
@@ -67,7 +123,7 @@ QVariant Quellon::parse(const QString& xml)
                 root.insert(frame.name, std::move(value));
                 rootClosed = true;
             } else {
-                stack.back().children[frame.name].append(std::move(value));
+                stack.back().childList(frame.name).append(std::move(value));
             }
             break;
         }

@@ -46,6 +46,32 @@ TEST(Quellon, RepeatedElementsBecomeListInDocumentOrderSingleStaysValue)
     EXPECT_EQ(l.value(QStringLiteral("J")).typeId(), QMetaType::QString);
 }
 
+TEST(Quellon, ManyDistinctChildNamesKeepTheirOccurrences)
+{
+    // Past a handful of names the children are found by hash; both paths must agree.
+    QString xml = QStringLiteral("<R>");
+    for (int round = 0; round < 3; ++round) {
+        for (int i = 0; i < 40; ++i) {
+            if (round == 0 || i % 2 == 0) {
+                xml += QStringLiteral("<N%1>%2</N%1>").arg(i).arg(round);
+            }
+        }
+    }
+    xml += QStringLiteral("</R>");
+    const QVariantMap r = parseMap(xml).value(QStringLiteral("R")).toMap();
+    ASSERT_EQ(r.size(), 40);
+    for (int i = 0; i < 40; ++i) {
+        const QVariant value = r.value(QStringLiteral("N%1").arg(i));
+        if (i % 2 == 0) {
+            EXPECT_EQ(value.toList(),
+                      (QVariantList{QStringLiteral("0"), QStringLiteral("1"), QStringLiteral("2")}))
+                << i;
+        } else {
+            EXPECT_EQ(value, QVariant(QStringLiteral("0"))) << i;
+        }
+    }
+}
+
 TEST(Quellon, EmptyElementsWhitespaceCdataAndEscapes)
 {
     const QVariantMap root =

@@ -59,6 +59,7 @@ private:
     QVariantMap m_cameraDirectoryMap;
     QVariantMap m_cameraStatusMap;
     QSharedPointer<NOVIRSrvTunnelControl> m_tunnelControl;
+    // Written by setDelvixSettings, read by writeData, possibly on different threads: atomic.
     std::atomic<bool> m_bFaceThumbnail{true};
     std::atomic<bool> m_bPlateThumbnail{true};
 

@@ -101,6 +101,15 @@ struct StoredItem
     int vault = EitherVault;
 };
 
+// A search to run again alone after the load, to compare its number of hits.
+struct Replay
+{
+    QString command;
+    QJsonObject params;
+    qsizetype hits = 0;
+    bool stopped = false;
+};
+
 struct ClientStats
 {
     int sent = 0;
@@ -115,6 +124,7 @@ struct ClientStats
     QStringList faults;              // lost replies, foreign hits, refused case writes
     QList<StoredItem> cases;         // acknowledged cases, with the item they were made with
     QList<StoredItem> items;         // acknowledged items added to existing cases
+    QList<Replay> replays;
 };
 
 struct Answer
@@ -303,17 +313,28 @@ private:
                       qint64 startMs, qint64 endMs)
     {
         QNetworkAccessManager& network = m_network;
+        const qint64 sentMs = QDateTime::currentMSecsSinceEpoch();
         const auto answer = post(network, m_port, envelope(command, params));
         if (!stop) {
             waitFor({answer});
         } else {
             sleepOnLoop(10 + pickUpTo(150));
+            m_lastStopMs = QDateTime::currentMSecsSinceEpoch();
             const auto stopped = post(network, m_port, envelope(stopCommand, QJsonObject(), 0.2));
             waitFor({answer, stopped});
             checkSilent(stopCommand, *stopped);
         }
-        if (checkFinal(command, *answer)) {
-            checkHits(command, *answer, startMs, endMs);
+        if (!checkFinal(command, *answer)) {
+            return;
+        }
+        checkHits(command, *answer, startMs, endMs);
+        // A search of this client's that nobody stopped must deliver all its hits, whatever other
+        // clients stop meanwhile. Our own stop answers end before the plug-in may have handled
+        // it, so searches soon after one are not compared.
+        const Replay replay{command, params, answer->lines.size() - 1, stop};
+        if (stop ? m_stoppedReplays < 3 : (m_unstoppedReplays < 6 && sentMs > m_lastStopMs + 2000)) {
+            ++(stop ? m_stoppedReplays : m_unstoppedReplays);
+            m_stats->replays << replay;
         }
     }
 
@@ -476,6 +497,9 @@ private:
     QNetworkAccessManager m_network;
     QJsonArray m_feature; // from one of this client's own hits, for re-identification
     int m_itemSequence = 0;
+    qint64 m_lastStopMs = 0;
+    int m_stoppedReplays = 0;
+    int m_unstoppedReplays = 0;
 };
 
 struct VaultItem
@@ -707,6 +731,37 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     EXPECT_GT(synchronisedHits, 0) << "nothing the cameras recorded during the run was found; see "
                                    << qPrintable(QDir(dataDir).filePath(QStringLiteral("serve.log")));
 
+    // The compared searches again, one at a time: unstopped ones must find exactly as much.
+    int replayed = 0;
+    int cutShort = 0;
+    int stoppedReplayed = 0;
+    QStringList replayFaults;
+    for (const ClientStats& s : stats) {
+        for (const Replay& replay : s.replays) {
+            const auto again = post(network, port,
+                                    QJsonObject{{QStringLiteral("command"), replay.command},
+                                                {QStringLiteral("client"), QStringLiteral("load-replay")},
+                                                {QStringLiteral("params"), replay.params}});
+            waitFor({again});
+            const qsizetype hits = again->lines.size() - 1;
+            if (replay.stopped) {
+                ++stoppedReplayed;
+                cutShort += hits > replay.hits ? 1 : 0;
+            } else {
+                ++replayed;
+                if (hits != replay.hits) {
+                    replayFaults
+                        << QStringLiteral("%1 with %2 hit(s) under load finds %3 alone: %4")
+                               .arg(replay.command)
+                               .arg(replay.hits)
+                               .arg(hits)
+                               .arg(QString::fromUtf8(
+                                   QJsonDocument(replay.params).toJson(QJsonDocument::Compact).left(200)));
+                }
+            }
+        }
+    }
+
     const qint64 endRssKb = procStatusKb(pid, "VmRSS");
     const qint64 peakRssKb = procStatusKb(pid, "VmHWM");
     ::kill(pid_t(pid), SIGTERM);
@@ -719,7 +774,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     const int servedByServer = servedMatch.captured(1).toInt();
 
     ClientStats total;
-    QStringList faults;
+    QStringList faults = replayFaults;
     for (const ClientStats& s : stats) {
         total.sent += s.sent;
         total.finals += s.finals;
@@ -763,6 +818,8 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
                 "  served: %d (server's count), %.1f requests/s over %.1f s\n"
                 "  mix: %d searches, %d stopped searches, %d re-identifications, %d case commands, %d hits\n"
                 "  cases: %lld acknowledged, %lld items added later, %d missing; vault entries %lld + %lld\n"
+                "  stops: %d of %d stopped searches run again alone found more (cut short by the stop); "
+                "%d unstopped searches run again alone found the same\n"
                 "  synchroniser: %lld objects of this run found at the site's locations\n"
                 "  server memory: peak RSS %.1f MB, RSS a quarter in %.1f MB, at the end %.1f MB\n",
                 clients, seconds, objects,
@@ -772,6 +829,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
                 total.reIdSearches, total.caseCommands, total.hits,
                 static_cast<long long>(total.cases.size()), static_cast<long long>(total.items.size()),
                 missing, static_cast<long long>(vaults[0].size()), static_cast<long long>(vaults[1].size()),
+                cutShort, stoppedReplayed, replayed - int(replayFaults.size()),
                 static_cast<long long>(synchronisedHits), double(peakRssKb) / 1024.0,
                 double(settledRssKb) / 1024.0, double(endRssKb) / 1024.0);
     for (auto it = total.failureCodes.cbegin(); it != total.failureCodes.cend(); ++it) {

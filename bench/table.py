@@ -102,6 +102,10 @@ def run_program(path, env_extra, args, results):
     return {"rc": process.returncode, "seconds": took, "output": "".join(output), "entries": entries}
 
 
+def find_entry(entries, pattern):
+    return next((e for e in entries if fnmatch.fnmatchcase(e.get("name", ""), pattern)), None)
+
+
 def measure(target, result):
     """Returns (value in the target's unit or None, note)."""
     if result is None:
@@ -115,9 +119,13 @@ def measure(target, result):
         if isinstance(last, tuple):
             last = next((group for group in last if group), "")
         return float(last) * UNITS[target.unit] / UNITS[unit], None
-    entry = next((e for e in result["entries"] if fnmatch.fnmatchcase(e.get("name", ""), target.entry)), None)
+    entry = find_entry(result["entries"], target.entry)
     if entry is None:
-        return None, "not measured (no entry %s)" % target.entry
+        # A benchmark that stopped with an error has only its failed run, no aggregates.
+        run = find_entry(result["entries"], re.sub(r"_(median|mean|stddev|cv)$", "", target.entry))
+        if run is None or not run.get("error_occurred"):
+            return None, "not measured (no entry %s)" % target.entry
+        entry = run
     if entry.get("error_occurred"):
         return None, "error: %s" % entry.get("error_message", "")
     if target.kind == "counter":
@@ -187,6 +195,7 @@ def main():
     for target in targets:
         value, note = measure(target, results.get(target.program))
         unit = target.target_unit or target.unit or ""
+        unit = "" if unit == "1" else unit
         target_text = "-" if target.op is None else "%s %s %s" % (target.op, number(target.target), unit)
         if value is None:
             lines.append("| %s | %s | %s | | |" % (target.figure, target_text, note))

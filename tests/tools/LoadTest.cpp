@@ -54,6 +54,10 @@ constexpr qint64 kSeedStartMs = 1704067200000LL;
 constexpr qint64 kSeedSpanMs = 4 * 3600 * 1000LL;
 // Generous: a request still open after this is a lost reply, not a slow one.
 constexpr int kRequestTimeoutMs = 120000;
+// How long the API waits for a first reply before it ends an answer as one of a command that
+// sends none. Searches run one at a time, so under load a search may wait its turn for many
+// seconds: the API's default of 2 s would end its answer empty and drop its hits.
+constexpr double kFirstReplyWaitSeconds = 90.0;
 
 int envInt(const char* name, int fallback)
 {
@@ -217,8 +221,8 @@ public:
 private:
     int pickUpTo(int bound) { return std::uniform_int_distribution<int>(0, bound - 1)(m_random); }
 
-    QJsonObject envelope(const QString& command, const QJsonValue& params, double wait = 2.0,
-                         const QString& name = QString()) const
+    QJsonObject envelope(const QString& command, const QJsonValue& params,
+                         double wait = kFirstReplyWaitSeconds, const QString& name = QString()) const
     {
         return {{QStringLiteral("command"), command},
                 {QStringLiteral("client"), name.isEmpty() ? m_name : name},
@@ -319,7 +323,7 @@ private:
         // before the plug-in may have handled the stop, and a late stop must not reach the next
         // search, which is compared in full below.
         const QString& name = stop ? m_stopName : m_name;
-        const auto answer = post(network, m_port, envelope(command, params, 2.0, name));
+        const auto answer = post(network, m_port, envelope(command, params, kFirstReplyWaitSeconds, name));
         if (!stop) {
             waitFor({answer});
         } else {
@@ -727,6 +731,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
              QJsonObject{
                  {QStringLiteral("command"), QStringLiteral("startSearch")},
                  {QStringLiteral("client"), QStringLiteral("load-sync-check")},
+                 {QStringLiteral("wait"), kFirstReplyWaitSeconds},
                  {QStringLiteral("params"),
                   QJsonObject{{QStringLiteral("startTimestamp"), double(serveStartMs - 3600 * 1000LL)},
                               {QStringLiteral("endTimestamp"), double(QDateTime::currentMSecsSinceEpoch())},
@@ -746,6 +751,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
             const auto again = post(network, port,
                                     QJsonObject{{QStringLiteral("command"), replay.command},
                                                 {QStringLiteral("client"), QStringLiteral("load-replay")},
+                                                {QStringLiteral("wait"), kFirstReplyWaitSeconds},
                                                 {QStringLiteral("params"), replay.params}});
             waitFor({again});
             const qsizetype hits = again->lines.size() - 1;

@@ -102,6 +102,18 @@ def run_program(path, env_extra, args, results):
     return {"rc": process.returncode, "seconds": took, "output": "".join(output), "entries": entries}
 
 
+def stored_result(program, results):
+    result = {"rc": 0, "seconds": 0.0, "output": "", "entries": []}
+    try:
+        with open(os.path.join(results, program + ".txt"), encoding="utf-8") as f:
+            result["output"] = f.read()
+        with open(os.path.join(results, program + ".json"), encoding="utf-8") as f:
+            result["entries"] = json.load(f).get("benchmarks", [])
+    except (OSError, json.JSONDecodeError):
+        pass
+    return result
+
+
 def find_entry(entries, pattern):
     return next((e for e in entries if fnmatch.fnmatchcase(e.get("name", ""), pattern)), None)
 
@@ -157,6 +169,8 @@ def main():
     parser.add_argument("--locations", required=True)
     parser.add_argument("--targets", default=os.path.join(os.path.dirname(os.path.abspath(__file__)),
                                                           "targets.txt"))
+    parser.add_argument("--no-run", action="store_true",
+                        help="print the table of the last run again from the results folder")
     parser.add_argument("args", nargs="*")
     options = parser.parse_args()
 
@@ -169,6 +183,9 @@ def main():
     started = datetime.datetime.now(datetime.timezone.utc)
     results = {}
     for program in programs:
+        if options.no_run:
+            results[program] = stored_result(program, results_dir)
+            continue
         env, args = runs.get(program, ({}, []))
         results[program] = run_program(os.path.join(options.bin, program), env, args + options.args, results_dir)
 
@@ -200,7 +217,7 @@ def main():
         if value is None:
             lines.append("| %s | %s | %s | | |" % (target.figure, target_text, note))
             continue
-        measured = "%s %s" % (number(value), unit)
+        measured = ("%s %s" % (number(value), unit)).strip()
         if target.op is None:
             lines.append("| %s | - | %s | | |" % (target.figure, measured))
             continue
@@ -209,12 +226,15 @@ def main():
         lines.append("| %s | %s | %s | %.2f | %s |" % (target.figure, target_text, measured, ratio,
                                                          "met" if met else "MISSED"))
     lines.append("")
-    for program in programs:
+    if options.no_run:
+        lines.append("Printed again from the stored results of the last run (its date is in the JSON files).")
+    for program in programs if not options.no_run else []:
         result = results[program]
         lines.append("- %s: %.0f s%s" % (program, result["seconds"],
                                           "" if result["rc"] == 0 else ", FAILED (exit status %d)" % result["rc"]))
     lines.append("")
-    lines.append("Each program's output and JSON are in %s/." % os.path.relpath(results_dir))
+    shown = os.path.relpath(results_dir)
+    lines.append("Each program's output and JSON are in %s/." % (shown if not shown.startswith("..") else results_dir))
     table = "\n".join(lines) + "\n"
     print()
     sys.stdout.write(table)

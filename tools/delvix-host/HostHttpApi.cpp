@@ -7,6 +7,7 @@
 #include <QHttpServerRequest>
 #include <QJsonDocument>
 #include <QJsonObject>
+#include <QStringList>
 #include <QTcpSocket>
 #include <QTimer>
 #include <QUrlQuery>
@@ -39,6 +40,24 @@ void finishStream(QTcpSocket* socket)
 {
     socket->write("0\r\n\r\n");
     socket->disconnectFromHost();
+}
+
+// How long an answer waits for the final reply of a command that does reply.
+constexpr double kFinalReplyLimitSeconds = 600.0;
+
+// The commands that never answer, and the add commands whose item list is empty (no batch).
+bool sendsNoReply(const QString& command, const QVariant& params)
+{
+    static const QStringList silent{QStringLiteral("stopSearch"), QStringLiteral("stopReIdSearch"),
+                                    QStringLiteral("retrieveDelvixData")};
+    if (silent.contains(command)) {
+        return true;
+    }
+    if (command == QLatin1String("addCaseWithRecordings") ||
+        command == QLatin1String("addCaseItemFromRecordings")) {
+        return params.toMap().value(QStringLiteral("caseItem")).toList().isEmpty();
+    }
+    return false;
 }
 
 } // namespace
@@ -208,8 +227,11 @@ void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVa
             },
             Qt::QueuedConnection);
     };
-    QTimer::singleShot(qRound(waitSeconds * 1000), this, [stream]() {
-        if (!stream->anyReply && !stream->finished) {
+    // Only a command that sends no reply ends after the short wait; a search queued behind
+    // others may take longer than that before its first hit, and must not lose its hits.
+    const double limitSeconds = sendsNoReply(command, params) ? waitSeconds : kFinalReplyLimitSeconds;
+    QTimer::singleShot(qRound(limitSeconds * 1000), this, [stream]() {
+        if (!stream->finished) {
             stream->finished = true;
             if (stream->socket) {
                 finishStream(stream->socket);

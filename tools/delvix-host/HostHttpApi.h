@@ -11,9 +11,11 @@
 //
 // The answer is 200 with Content-Type application/x-ndjson in chunked transfer encoding: one
 // line {"final", "code", "message", "payload"} per reply, as it arrives; the body ends with the
-// final reply, or after "wait" seconds (default 2) when no reply at all has come (the stop
-// commands send none). A client name maps to one sender handle for the life of the server, so
-// a client's "stopSearch" stops that client's own search. Bad requests get 400 with a text.
+// final reply. A command that sends no reply at all (the stops, "retrieveDelvixData", an add with
+// an empty item list) ends after "wait" seconds (default 2); any other waits for its final reply,
+// ten minutes at most, however long it was queued behind other searches. A client name maps to
+// one sender handle for the life of the server, so a client's "stopSearch" stops that client's
+// own search. Bad requests get 400 with a text.
 //
 // Threads: lives on the host's main thread; replies arriving on other threads are handed to it.
 // Listens on loopback addresses only.

@@ -42,8 +42,11 @@ public:
     }
     int finals() const
     {
+        // Counted under the lock: iterating a copy would detach it outside the lock while the
+        // plug-in's thread appends, which leans on Qt's unsynchronised reference-count check.
+        QMutexLocker lock(&m_mutex);
         int count = 0;
-        for (const Reply& reply : replies()) {
+        for (const Reply& reply : m_replies) {
             count += reply.bFinal ? 1 : 0;
         }
         return count;

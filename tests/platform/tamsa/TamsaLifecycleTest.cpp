@@ -55,16 +55,16 @@ TEST_F(TamsaLifecycleTest, ReingestReplacesWithoutDuplicates)
     ObjectSpec sameIdElsewhere = object;
     ASSERT_EQ(put(2, {sameIdElsewhere}), 1) << "the key is (location, ID)";
 
-    QuerySpec spec;
-    const std::vector<ResultCopy> results = search(spec);
+    QueryOptions options;
+    const std::vector<ResultCopy> results = search(options);
     ASSERT_EQ(results.size(), 1u);
     EXPECT_NE(results[0].attributes.find("\"Gender\":1"), std::string::npos);
-    spec.feature = jsonArray(oldVector);
-    EXPECT_TRUE(search(spec).empty()) << "the replaced vector is no longer searched";
-    spec.feature = jsonArray(newVector);
-    EXPECT_EQ(searchIds(spec), Ids{42});
-    spec.locations = {1, 2};
-    EXPECT_EQ(search(spec).size(), 2u);
+    options.feature = jsonArray(oldVector);
+    EXPECT_TRUE(search(options).empty()) << "the replaced vector is no longer searched";
+    options.feature = jsonArray(newVector);
+    EXPECT_EQ(searchIds(options), Ids{42});
+    options.locations = {1, 2};
+    EXPECT_EQ(search(options).size(), 2u);
 
     ObjectSpec twice; // the same ID twice in one answer: the later one wins
     twice.id = 7;
@@ -72,9 +72,9 @@ TEST_F(TamsaLifecycleTest, ReingestReplacesWithoutDuplicates)
     ObjectSpec later = twice;
     later.attributes = R"({"Age":"Old"})";
     EXPECT_EQ(put(3, {twice, later}), 1);
-    spec = QuerySpec();
-    spec.locations = {3};
-    const std::vector<ResultCopy> third = search(spec);
+    options = QueryOptions();
+    options.locations = {3};
+    const std::vector<ResultCopy> third = search(options);
     ASSERT_EQ(third.size(), 1u);
     EXPECT_NE(third[0].attributes.find("Old"), std::string::npos);
 }
@@ -126,8 +126,8 @@ TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
         R"({"ObjectMetaInfo":[)" + objectJson(good) +
         R"(,{"ID":9,"ObjectType":"Human","StartTime":1,"EndTime":2,"Attributes":{"a":)" + deep + "}}]}";
     EXPECT_EQ(putText(1, nested), TAMSA_E_BAD_JSON);
-    QuerySpec spec;
-    EXPECT_EQ(searchIds(spec), Ids{5});
+    QueryOptions options;
+    EXPECT_EQ(searchIds(options), Ids{5});
 
     void* unset = nullptr;
     unsigned char record[704] = {0xC0, 0x02};
@@ -177,24 +177,24 @@ TEST_F(TamsaLifecycleTest, MutatedAnswersAndQueriesAreRefusedOrStoredNeverCrash)
         EXPECT_TRUE(result >= 0 || result == TAMSA_E_BAD_JSON) << result;
         stored += result > 0 ? result : 0;
 
-        QuerySpec spec; // the same text as every query field
-        spec.locations = {1, 2, 3};
+        QueryOptions options; // the same text as every query field
+        options.locations = {1, 2, 3};
         const std::string fragment = text.substr(random() % text.size(), 40);
         switch (round % 4) {
         case 0:
-            spec.primary = fragment;
+            options.primary = fragment;
             break;
         case 1:
-            spec.trace = fragment;
+            options.trace = fragment;
             break;
         case 2:
-            spec.feature = fragment;
+            options.feature = fragment;
             break;
         default:
-            spec.plate = fragment;
+            options.plate = fragment;
         }
         int32_t status = 0;
-        search(spec, &status);
+        search(options, &status);
         EXPECT_TRUE(status == TAMSA_E_NO_MORE_RECORDS || status == TAMSA_E_BAD_QUERY) << status;
     }
     EXPECT_GT(stored, 0) << "some mutations leave valid objects";
@@ -206,9 +206,9 @@ TEST_F(TamsaLifecycleTest, MutatedAnswersAndQueriesAreRefusedOrStoredNeverCrash)
     std::string answer = answerJson({tricky});
     answer.replace(answer.find("aW1hZ2U"), 7, "\\u0001\\u0002");
     ASSERT_EQ(putText(9, answer), 1);
-    QuerySpec spec;
-    spec.locations = {9};
-    const std::vector<ResultCopy> results = search(spec);
+    QueryOptions options;
+    options.locations = {9};
+    const std::vector<ResultCopy> results = search(options);
     ASSERT_EQ(results.size(), 1u);
     const QJsonObject thumbnail = QJsonDocument::fromJson(QByteArray::fromStdString(results[0].thumbnails))
                                       .object()
@@ -248,18 +248,18 @@ TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
 
     m_database = openHandle();
     ASSERT_NE(m_database, nullptr);
-    QuerySpec spec;
-    EXPECT_EQ(searchIds(spec), (Ids{11, 12}));
-    spec.feature = jsonArray(randomUnitVector(12));
-    EXPECT_EQ(searchIds(spec), Ids{12}) << "the child's vector is on disk too";
+    QueryOptions options;
+    EXPECT_EQ(searchIds(options), (Ids{11, 12}));
+    options.feature = jsonArray(randomUnitVector(12));
+    EXPECT_EQ(searchIds(options), Ids{12}) << "the child's vector is on disk too";
 }
 
 TEST_F(TamsaLifecycleTest, AbortFromAnotherThreadEndsTheSearch)
 {
     ASSERT_EQ(put(1, manyObjects(1, 3000, false)), 3000);
-    QuerySpec spec;
+    QueryOptions options;
     std::vector<uint32_t> locations;
-    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(options, &locations);
     void* search = nullptr;
     ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &query, &search), TAMSA_OK);
 
@@ -298,13 +298,13 @@ TEST_F(TamsaLifecycleTest, AbortDuringAFeatureScan)
     for (uint32_t location = 1; location <= 4; ++location) {
         ASSERT_EQ(put(location, manyObjects(location * 10000, 2000, true)), 2000);
     }
-    QuerySpec spec;
-    spec.locations = {1, 2, 3, 4};
-    spec.feature = jsonArray(randomUnitVector(10005));
-    EXPECT_EQ(searchIds(spec), Ids{10005});
+    QueryOptions options;
+    options.locations = {1, 2, 3, 4};
+    options.feature = jsonArray(randomUnitVector(10005));
+    EXPECT_EQ(searchIds(options), Ids{10005});
 
     std::vector<uint32_t> locations;
-    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(options, &locations);
     // Abort lands at some point of the scan (or just before it); the Next must report it.
     for (int delayMicroseconds : {0, 100, 300, 1000}) {
         void* search = nullptr;
@@ -334,10 +334,10 @@ TEST_F(TamsaLifecycleTest, HandlesSearchAndIngestOnSeveralThreadsAtOnce)
 {
     ASSERT_EQ(put(1, manyObjects(1, 400, true)), 400);
     ASSERT_EQ(put(2, manyObjects(1001, 400, true)), 400);
-    QuerySpec plain;
+    QueryOptions plain;
     plain.locations = {1, 2};
     plain.primary = R"({"Gender":1})";
-    QuerySpec feature;
+    QueryOptions feature;
     feature.locations = {1, 2};
     feature.feature = jsonArray(randomUnitVector(1100));
     const Ids expectedPlain = searchIds(plain);
@@ -378,7 +378,7 @@ TEST_F(TamsaLifecycleTest, HandlesSearchAndIngestOnSeveralThreadsAtOnce)
         thread.join();
     }
     EXPECT_EQ(mismatches.load(), 0);
-    QuerySpec third;
+    QueryOptions third;
     third.locations = {3};
     EXPECT_EQ(searchIds(third).size(), 100u);
 

@@ -25,10 +25,10 @@ TEST_F(TamsaMatchingTest, TimeWindowOverlapsAtBothEdges)
     longStay.end = 9000;
     ASSERT_EQ(put(1, {object, longStay}), 2);
     auto window = [this](uint32_t start, uint32_t end) {
-        QuerySpec spec;
-        spec.start = start;
-        spec.end = end;
-        return searchIds(spec);
+        QueryOptions options;
+        options.start = start;
+        options.end = end;
+        return searchIds(options);
     };
     EXPECT_EQ(window(200, 300), Ids{1}) << "window starting at the object's end";
     EXPECT_EQ(window(50, 100), Ids{1}) << "window ending at the object's start";
@@ -45,15 +45,15 @@ TEST_F(TamsaMatchingTest, LocationListSelectsAndEmptyListMatchesNothing)
     ObjectSpec other;
     other.id = 2;
     ASSERT_EQ(put(3, {other}), 1);
-    QuerySpec spec;
-    spec.locations = {3};
-    EXPECT_EQ(searchIds(spec), Ids{2});
-    spec.locations = {1, 3, 1};
-    EXPECT_EQ(searchIds(spec).size(), 2u) << "a repeated location yields its objects once";
-    spec.locations = {};
-    EXPECT_EQ(searchIds(spec), Ids{});
-    spec.nullLocations = true;
-    EXPECT_EQ(searchIds(spec), Ids{});
+    QueryOptions options;
+    options.locations = {3};
+    EXPECT_EQ(searchIds(options), Ids{2});
+    options.locations = {1, 3, 1};
+    EXPECT_EQ(searchIds(options).size(), 2u) << "a repeated location yields its objects once";
+    options.locations = {};
+    EXPECT_EQ(searchIds(options), Ids{});
+    options.nullLocations = true;
+    EXPECT_EQ(searchIds(options), Ids{});
 }
 
 TEST_F(TamsaMatchingTest, ObjectTypeMustBeEqual)
@@ -62,11 +62,11 @@ TEST_F(TamsaMatchingTest, ObjectTypeMustBeEqual)
     car.id = 2;
     car.type = "Vehicle";
     ASSERT_EQ(put(1, {ObjectSpec{}, car}), 2);
-    QuerySpec spec;
-    spec.type = "Vehicle";
-    EXPECT_EQ(searchIds(spec), Ids{2});
-    spec.type = "Human";
-    EXPECT_EQ(searchIds(spec), Ids{1});
+    QueryOptions options;
+    options.type = "Vehicle";
+    EXPECT_EQ(searchIds(options), Ids{2});
+    options.type = "Human";
+    EXPECT_EQ(searchIds(options), Ids{1});
 }
 
 TEST_F(TamsaMatchingTest, AttributeListsScalarsNumbersAndTexts)
@@ -75,10 +75,10 @@ TEST_F(TamsaMatchingTest, AttributeListsScalarsNumbersAndTexts)
     person.attributes = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5],"Accessories":[]})";
     ASSERT_EQ(put(1, {person}), 1);
     auto matches = [this](const std::string& primary, const std::string& other) {
-        QuerySpec spec;
-        spec.primary = primary;
-        spec.other = other;
-        return searchIds(spec) == Ids{1};
+        QueryOptions options;
+        options.primary = primary;
+        options.other = other;
+        return searchIds(options) == Ids{1};
     };
     EXPECT_TRUE(matches(R"({"UpperColor":[5,7]})", "")) << "list shares a value with a list";
     EXPECT_FALSE(matches(R"({"UpperColor":[7,8]})", ""));
@@ -109,9 +109,9 @@ TEST_F(TamsaMatchingTest, PlatesMatchContainedTextWithWildcards)
     person.id = 3;
     ASSERT_EQ(put(1, {first, second, person}), 3);
     auto plate = [this](const std::string& pattern) {
-        QuerySpec spec;
-        spec.plate = pattern;
-        return searchIds(spec);
+        QueryOptions options;
+        options.plate = pattern;
+        return searchIds(options);
     };
     EXPECT_EQ(plate("c-12"), Ids{1}) << "contained, case-insensitive";
     EXPECT_EQ(plate("a*4"), Ids{1});
@@ -119,11 +119,11 @@ TEST_F(TamsaMatchingTest, PlatesMatchContainedTextWithWildcards)
     EXPECT_EQ(plate("A?B"), Ids{});
     EXPECT_EQ(plate("Z 99"), Ids{2});
     EXPECT_EQ(plate("*"), (Ids{1, 2})) << "only objects with a plate";
-    QuerySpec spec;
-    spec.primary = R"({"PlateNumber":"*99"})";
-    EXPECT_EQ(searchIds(spec), Ids{2}) << "the PlateNumber attribute condition uses the same rule";
-    spec.primary = R"({"PlateNumber":"bc-1","Type":3})";
-    EXPECT_EQ(searchIds(spec), Ids{1});
+    QueryOptions options;
+    options.primary = R"({"PlateNumber":"*99"})";
+    EXPECT_EQ(searchIds(options), Ids{2}) << "the PlateNumber attribute condition uses the same rule";
+    options.primary = R"({"PlateNumber":"bc-1","Type":3})";
+    EXPECT_EQ(searchIds(options), Ids{1});
 }
 
 TEST_F(TamsaMatchingTest, LineIsCrossedInTheRequestedDirection)
@@ -140,17 +140,17 @@ TEST_F(TamsaMatchingTest, LineIsCrossedInTheRequestedDirection)
     passesBeyondTheEnd.id = 4;
     passesBeyondTheEnd.trajectory = {{0.1, 1.5}, {0.9, 1.5}};
     ASSERT_EQ(put(1, {rightToLeft, leftToRight, stays, passesBeyondTheEnd}), 4);
-    QuerySpec spec;
-    spec.trace = "[[0.5,0],[0.5,1]]";
-    spec.direction = 0;
-    EXPECT_EQ(searchIds(spec), (Ids{1, 2}));
-    spec.direction = 2; // positive to negative
-    EXPECT_EQ(searchIds(spec), Ids{1});
-    spec.direction = 1;
-    EXPECT_EQ(searchIds(spec), Ids{2});
-    spec.direction = 5;
+    QueryOptions options;
+    options.trace = "[[0.5,0],[0.5,1]]";
+    options.direction = 0;
+    EXPECT_EQ(searchIds(options), (Ids{1, 2}));
+    options.direction = 2; // positive to negative
+    EXPECT_EQ(searchIds(options), Ids{1});
+    options.direction = 1;
+    EXPECT_EQ(searchIds(options), Ids{2});
+    options.direction = 5;
     int32_t status = 0;
-    search(spec, &status);
+    search(options, &status);
     EXPECT_EQ(status, TAMSA_E_BAD_QUERY);
 }
 
@@ -167,9 +167,9 @@ TEST_F(TamsaMatchingTest, ZoneIsEntered)
     ObjectSpec noTrajectory;
     noTrajectory.id = 4;
     ASSERT_EQ(put(1, {through, outside, jumpsAcross, noTrajectory}), 4);
-    QuerySpec spec;
-    spec.trace = R"([{"x":0.4,"y":0.4},{"x":0.6,"y":0.4},{"x":0.6,"y":0.6},{"x":0.4,"y":0.6}])";
-    EXPECT_EQ(searchIds(spec), (Ids{1, 3}));
+    QueryOptions options;
+    options.trace = R"([{"x":0.4,"y":0.4},{"x":0.6,"y":0.4},{"x":0.6,"y":0.6},{"x":0.4,"y":0.6}])";
+    EXPECT_EQ(searchIds(options), (Ids{1, 3}));
 }
 
 TEST_F(TamsaMatchingTest, LoiteringNeedsTheDurationInside)
@@ -182,15 +182,15 @@ TEST_F(TamsaMatchingTest, LoiteringNeedsTheDurationInside)
         loiterer.trajectory.push_back({inside ? 0.5 : 0.1, 0.5});
     }
     ASSERT_EQ(put(1, {loiterer}), 1);
-    QuerySpec spec;
-    spec.trace = "[[0.4,0.4],[0.6,0.4],[0.6,0.6],[0.4,0.6]]";
-    spec.loitering = true;
-    spec.duration = 5;
-    EXPECT_EQ(searchIds(spec), Ids{1});
-    spec.duration = 6;
-    EXPECT_EQ(searchIds(spec), Ids{});
-    spec.loitering = false; // plain entry ignores the duration
-    EXPECT_EQ(searchIds(spec), Ids{1});
+    QueryOptions options;
+    options.trace = "[[0.4,0.4],[0.6,0.4],[0.6,0.6],[0.4,0.6]]";
+    options.loitering = true;
+    options.duration = 5;
+    EXPECT_EQ(searchIds(options), Ids{1});
+    options.duration = 6;
+    EXPECT_EQ(searchIds(options), Ids{});
+    options.loitering = false; // plain entry ignores the duration
+    EXPECT_EQ(searchIds(options), Ids{1});
 }
 
 TEST_F(TamsaMatchingTest, StartTimeOrderAcrossLocations)
@@ -209,13 +209,13 @@ TEST_F(TamsaMatchingTest, StartTimeOrderAcrossLocations)
     }
     ASSERT_EQ(put(1, east), 5);
     ASSERT_EQ(put(2, west), 5);
-    QuerySpec spec;
-    spec.locations = {2, 1};
-    EXPECT_EQ(searchIds(spec), (Ids{10, 20, 11, 21, 12, 22, 13, 23, 14, 24}));
-    spec.descending = true;
-    EXPECT_EQ(searchIds(spec), (Ids{24, 14, 23, 13, 22, 12, 21, 11, 20, 10}));
-    spec.doNotSort = true;
-    Ids unsorted = searchIds(spec);
+    QueryOptions options;
+    options.locations = {2, 1};
+    EXPECT_EQ(searchIds(options), (Ids{10, 20, 11, 21, 12, 22, 13, 23, 14, 24}));
+    options.descending = true;
+    EXPECT_EQ(searchIds(options), (Ids{24, 14, 23, 13, 22, 12, 21, 11, 20, 10}));
+    options.doNotSort = true;
+    Ids unsorted = searchIds(options);
     std::sort(unsorted.begin(), unsorted.end());
     EXPECT_EQ(unsorted, (Ids{10, 11, 12, 13, 14, 20, 21, 22, 23, 24}));
 }
@@ -242,9 +242,9 @@ TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
     vehicle.type = "Vehicle";
     ASSERT_EQ(put(1, {close, farther, stranger, faceOnly, vehicle}), 5);
 
-    QuerySpec spec;
-    spec.feature = jsonArray(identity);
-    std::vector<ResultCopy> results = search(spec);
+    QueryOptions options;
+    options.feature = jsonArray(identity);
+    std::vector<ResultCopy> results = search(options);
     ASSERT_EQ(results.size(), 2u);
     EXPECT_EQ(results[0].id, 1u);
     EXPECT_EQ(results[1].id, 2u);
@@ -253,8 +253,8 @@ TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
     EXPECT_GE(results[1].score, 0.5f);
     EXPECT_EQ(results[0].faceScore, 0.0f) << "no face vector in the query";
 
-    spec.faceFeature = jsonArray(faceIdentity);
-    results = search(spec);
+    options.faceFeature = jsonArray(faceIdentity);
+    results = search(options);
     ASSERT_EQ(results.size(), 3u);
     EXPECT_EQ(results[0].id, 4u) << "the face score is the best of all";
     EXPECT_NEAR(results[0].faceScore, plainCosine(faceIdentity, faceOnly.face), 1e-5);
@@ -266,22 +266,22 @@ TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
                   std::max(results[i].score, results[i].faceScore));
     }
 
-    spec.doNotSort = true;
+    options.doNotSort = true;
     Ids unsorted;
-    for (const ResultCopy& result : search(spec)) {
+    for (const ResultCopy& result : search(options)) {
         unsorted.push_back(result.id);
     }
     std::sort(unsorted.begin(), unsorted.end());
     EXPECT_EQ(unsorted, (Ids{1, 2, 4}));
 
-    spec = QuerySpec();
-    spec.feature = jsonArray(identity);
-    spec.start = 2000; // time still applies to feature searches
-    EXPECT_TRUE(search(spec).empty());
-    spec = QuerySpec();
-    spec.feature = "[1,2";
+    options = QueryOptions();
+    options.feature = jsonArray(identity);
+    options.start = 2000; // time still applies to feature searches
+    EXPECT_TRUE(search(options).empty());
+    options = QueryOptions();
+    options.feature = "[1,2";
     int32_t status = 0;
-    search(spec, &status);
+    search(options, &status);
     EXPECT_EQ(status, TAMSA_E_BAD_QUERY);
 }
 
@@ -295,9 +295,9 @@ TEST_F(TamsaMatchingTest, ResultRecordCarriesTextsTrajectoryAndVectors)
     person.face = randomUnitVector(4);
     person.faceFiltered = true;
     ASSERT_EQ(put(9, {person}), 1);
-    QuerySpec spec;
-    spec.locations = {9};
-    const std::vector<ResultCopy> results = search(spec);
+    QueryOptions options;
+    options.locations = {9};
+    const std::vector<ResultCopy> results = search(options);
     ASSERT_EQ(results.size(), 1u);
     const ResultCopy& result = results[0];
     EXPECT_EQ(result.id, person.id);
@@ -330,9 +330,9 @@ TEST_F(TamsaMatchingTest, ResultRecordCarriesTextsTrajectoryAndVectors)
 TEST_F(TamsaMatchingTest, EndCodeAfterTheLastRecordAndArgumentErrors)
 {
     ASSERT_EQ(put(1, {ObjectSpec{}}), 1);
-    QuerySpec spec;
+    QueryOptions options;
     std::vector<uint32_t> locations;
-    TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(options, &locations);
     void* search = nullptr;
     ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &query, &search), TAMSA_OK);
     TTAMSA_OBJECTMETAINFO_RESULT record{};

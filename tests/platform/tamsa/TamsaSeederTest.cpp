@@ -52,7 +52,7 @@ TEST_F(TamsaSeederTest, AnswersAreDeterministicAndComplete)
     EXPECT_EQ(report.status, 0);
     EXPECT_EQ(report.stored, 600u);
     EXPECT_EQ(report.people + report.vehicles, 600u);
-    QuerySpec all;
+    QueryOptions all;
     all.locations = {1, 2, 3};
     EXPECT_EQ(searchIds(all).size(), 600u);
 }
@@ -73,10 +73,10 @@ TEST_F(TamsaSeederTest, SightingsOfOneIdentityAreFoundAndOthersAreNot)
         }
     }
     ASSERT_GT(expected, 3u);
-    QuerySpec spec;
-    spec.locations = {1, 2, 3, 4};
-    spec.feature = jsonArray(seeder.identityBody(identity));
-    const std::vector<ResultCopy> hits = search(spec);
+    QueryOptions query;
+    query.locations = {1, 2, 3, 4};
+    query.feature = jsonArray(seeder.identityBody(identity));
+    const std::vector<ResultCopy> hits = search(query);
     EXPECT_EQ(hits.size(), expected) << "every sighting and nobody else";
     std::set<uint32_t> locations;
     std::vector<std::vector<float>> sightings;

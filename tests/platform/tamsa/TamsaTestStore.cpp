@@ -95,29 +95,29 @@ std::string answerJson(const std::vector<ObjectSpec>& objects)
     return text + "]}";
 }
 
-TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QuerySpec& spec, std::vector<uint32_t>* locationsOut)
+TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QueryOptions& options, std::vector<uint32_t>* locationsOut)
 {
     TTAMSA_OBJECTMETAINFO_QUERY query;
     std::memset(&query, 0, sizeof query);
     query.wSize = sizeof query;
-    query.dwStartTime = spec.start;
-    query.dwEndTime = spec.end;
-    *locationsOut = spec.locations;
+    query.dwStartTime = options.start;
+    query.dwEndTime = options.end;
+    *locationsOut = options.locations;
     locationsOut->push_back(0);
-    query.pdwLocationIds = spec.nullLocations ? nullptr : locationsOut->data();
+    query.pdwLocationIds = options.nullLocations ? nullptr : locationsOut->data();
     auto text = [](const std::string& value) { return value.empty() ? nullptr : value.c_str(); };
-    query.pszObjectType = text(spec.type);
-    query.pszPrimaryAttributes = text(spec.primary);
-    query.pszOtherAttributes = text(spec.other);
-    query.pszTrace = text(spec.trace);
-    query.dwDuration = spec.duration;
-    query.bLoitering = spec.loitering;
-    query.bDescending = spec.descending;
-    query.nDirection = spec.direction;
-    query.bDoNotSort = spec.doNotSort;
-    query.pszFeature = text(spec.feature);
-    query.pszFaceFeature = text(spec.faceFeature);
-    query.pszPlateNumber = text(spec.plate);
+    query.pszObjectType = text(options.type);
+    query.pszPrimaryAttributes = text(options.primary);
+    query.pszOtherAttributes = text(options.other);
+    query.pszTrace = text(options.trace);
+    query.dwDuration = options.duration;
+    query.bLoitering = options.loitering;
+    query.bDescending = options.descending;
+    query.nDirection = options.direction;
+    query.bDoNotSort = options.doNotSort;
+    query.pszFeature = text(options.feature);
+    query.pszFaceFeature = text(options.faceFeature);
+    query.pszPlateNumber = text(options.plate);
     return query;
 }
 
@@ -163,10 +163,10 @@ int32_t TamsaStoreFixture::putText(uint32_t location, const std::string& json)
     return Tamsa_PutObjectMetaInfo(m_database, 7, int32_t(location), json.c_str());
 }
 
-std::vector<ResultCopy> TamsaStoreFixture::search(const QuerySpec& spec, int32_t* status, void* handle)
+std::vector<ResultCopy> TamsaStoreFixture::search(const QueryOptions& options, int32_t* status, void* handle)
 {
     std::vector<uint32_t> locations;
-    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(spec, &locations);
+    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(options, &locations);
     void* search = nullptr;
     std::vector<ResultCopy> results;
     int32_t code = Tamsa_GetObjectMetaInfoFirst(handle ? handle : m_database, &query, &search);
@@ -198,10 +198,10 @@ std::vector<ResultCopy> TamsaStoreFixture::search(const QuerySpec& spec, int32_t
     return results;
 }
 
-std::vector<uint64_t> TamsaStoreFixture::searchIds(const QuerySpec& spec)
+std::vector<uint64_t> TamsaStoreFixture::searchIds(const QueryOptions& options)
 {
     std::vector<uint64_t> ids;
-    for (const ResultCopy& result : search(spec)) {
+    for (const ResultCopy& result : search(options)) {
         ids.push_back(result.id);
     }
     return ids;

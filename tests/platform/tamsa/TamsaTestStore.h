@@ -38,7 +38,7 @@ struct ObjectSpec
 std::string objectJson(const ObjectSpec& object);
 std::string answerJson(const std::vector<ObjectSpec>& objects);
 
-struct QuerySpec
+struct QueryOptions
 {
     uint32_t start = 0;
     uint32_t end = 0xFFFFFFFFu;
@@ -72,8 +72,8 @@ struct ResultCopy
     float faceScore = 0;
 };
 
-// Builds the record; it points into `spec` and `locationsOut`, which must outlive it.
-TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QuerySpec& spec, std::vector<uint32_t>* locationsOut);
+// Builds the record; it points into `options` and `locationsOut`, which must outlive it.
+TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QueryOptions& options, std::vector<uint32_t>* locationsOut);
 
 class TamsaStoreFixture : public ::testing::Test
 {
@@ -87,8 +87,9 @@ protected:
     int32_t put(uint32_t location, const std::vector<ObjectSpec>& objects);
     int32_t putText(uint32_t location, const std::string& json);
     // Runs a search to its end; *status gets the code that ended it (or the First failure).
-    std::vector<ResultCopy> search(const QuerySpec& spec, int32_t* status = nullptr, void* handle = nullptr);
-    std::vector<uint64_t> searchIds(const QuerySpec& spec);
+    std::vector<ResultCopy> search(const QueryOptions& options, int32_t* status = nullptr,
+                                   void* handle = nullptr);
+    std::vector<uint64_t> searchIds(const QueryOptions& options);
 
     QTemporaryDir m_dir;
     void* m_database = nullptr;

@@ -354,16 +354,23 @@ QString PluginDelvixSrv::cameraNodeID(const QString& locationId) const
                                          : QString();
 }
 
+bool PluginDelvixSrv::searchesEnabled(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const
+{
+    if (m_bEnableDelvix.load() && m_pAttributeRetriever) {
+        return true;
+    }
+    // Switched off: the client gets the final reply at once and nothing is searched.
+    reply(hdlrDoRequestCB, RC_SUCCESS, QVariant());
+    return false;
+}
+
 void PluginDelvixSrv::commandStartSearch(const QVariant& params, const RequestSenderInfo& senderInfo,
                                          const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    if (!m_bEnableDelvix.load() || !m_pAttributeRetriever) {
-        if (hdlrDoRequestCB) {
-            hdlrDoRequestCB(true, RC_SUCCESS, QString(), QVariant());
-        }
-        return;
+    if (searchesEnabled(hdlrDoRequestCB)) {
+        m_pAttributeRetriever->query(senderInfo.senderHandle, params.toMap(),
+                                     makeResultRelay(hdlrDoRequestCB));
     }
-    m_pAttributeRetriever->query(senderInfo.senderHandle, params.toMap(), makeResultRelay(hdlrDoRequestCB));
 }
 
 void PluginDelvixSrv::commandStopSearch(const QVariant&, const RequestSenderInfo& senderInfo,
@@ -377,13 +384,10 @@ void PluginDelvixSrv::commandStopSearch(const QVariant&, const RequestSenderInfo
 void PluginDelvixSrv::commandStartReIdSearch(const QVariant& params, const RequestSenderInfo& senderInfo,
                                              const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    if (!m_bEnableDelvix.load() || !m_pAttributeRetriever) {
-        if (hdlrDoRequestCB) {
-            hdlrDoRequestCB(true, RC_SUCCESS, QString(), QVariant());
-        }
-        return;
+    if (searchesEnabled(hdlrDoRequestCB)) {
+        m_pAttributeRetriever->reId(senderInfo.senderHandle, params.toMap(),
+                                    makeResultRelay(hdlrDoRequestCB));
     }
-    m_pAttributeRetriever->reId(senderInfo.senderHandle, params.toMap(), makeResultRelay(hdlrDoRequestCB));
 }
 
 void PluginDelvixSrv::commandStopReIdSearch(const QVariant&, const RequestSenderInfo& senderInfo,

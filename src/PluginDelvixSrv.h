@@ -145,6 +145,8 @@ private:
     // scheduler thread, or from several re-identification threads at once.
     AttributeRetriever::Callback makeResultRelay(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
     QString cameraNodeID(const QString& locationId) const;
+    // True when a start command may search; otherwise answers the final reply itself.
+    bool searchesEnabled(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB) const;
 
     void ConnectSignal();
     // Directory changes reach the synchroniser; its fetched metadata reaches the directory.
@@ -163,7 +165,6 @@ private:
     static void replyNoCaseDatabase(const char* strCommand, const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
     static QList<QVariant> withCaseId(const QList<QVariant>& caseItemList, int caseId);
     static HDLR_RELAY_RESPONSE_CB relayResponse(const HDLR_DO_REQUEST_CB& hdlrDoRequestCB);
-
 
     // Created and used on the plug-in's thread; request threads only hand work over to it.
     QSharedPointer<CameraSynchronizer> m_cameraSynchronizer;

@@ -390,12 +390,11 @@ void PluginDelvixSrv::commandStartReIdSearch(const QVariant& params, const Reque
     }
 }
 
-void PluginDelvixSrv::commandStopReIdSearch(const QVariant&, const RequestSenderInfo& senderInfo,
-                                            const HDLR_DO_REQUEST_CB&)
+void PluginDelvixSrv::commandStopReIdSearch(const QVariant& params, const RequestSenderInfo& senderInfo,
+                                            const HDLR_DO_REQUEST_CB& hdlrDoRequestCB)
 {
-    if (m_pAttributeRetriever) {
-        m_pAttributeRetriever->stop(senderInfo.senderHandle);
-    }
+    // One stop serves both kinds: it ends whichever search the client is running.
+    commandStopSearch(params, senderInfo, hdlrDoRequestCB);
 }
 
 void PluginDelvixSrv::commandRetrieveDelvixData(const QVariant& params, const RequestSenderInfo&,

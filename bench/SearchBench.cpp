@@ -308,13 +308,19 @@ void runSeeded(benchmark::State& state, const QString& command, const QVariantMa
                                double(std::max<benchmark::IterationCount>(1, state.iterations()));
 }
 
-// One location, a one-hour window in the middle of the seeded span, people of one gender.
+// One location, a one-hour window in the middle of the seeded span, people of one gender. A store
+// smaller than the targets' 1,000,000 objects gets a proportionally wider window (at most the whole
+// span), so that the search still fills its 201 hits.
 QVariantMap attributeSearch()
 {
-    const qint64 start = (qint64(g_seeded.options.firstTime) + g_seeded.options.spanSeconds / 2) * 1000;
+    const uint64_t objects = std::max<uint64_t>(1, g_seeded.options.objects);
+    const qint64 window = qMin<qint64>(g_seeded.options.spanSeconds,
+                                       3600 * qMax<qint64>(1, qint64((1000000 + objects - 1) / objects)));
+    const qint64 start =
+        (qint64(g_seeded.options.firstTime) + (g_seeded.options.spanSeconds - window) / 2) * 1000;
     return {{KEY_LOC_ID_LIST, QStringList{QStringLiteral("Loc7")}},
             {KEY_START_TIMESTAMP, start},
-            {KEY_END_TIMESTAMP, start + 3600 * 1000},
+            {KEY_END_TIMESTAMP, start + window * 1000},
             {KEY_HUMAN_INFO, QStringLiteral(R"({"Gender":1})")}};
 }
 

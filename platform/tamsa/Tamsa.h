@@ -26,7 +26,9 @@
 // Storage: files under the directory given to Tamsa_SetStoragesDBPath (created on first use).
 // Tamsa_PutObjectMetaInfo returns only after the objects it counts are written to the store's
 // files: they survive a crash of the process (set TAMSA_SYNC=full to also sync them to the device, surviving a power
-// loss, at a much lower ingest rate). Several processes may share a directory.
+// loss, at a much lower ingest rate). Several processes may share a directory. A read-only
+// directory holding a store still opens and serves searches; ingest there (or into a full one)
+// fails with TAMSA_E_IO, stores nothing, and works again on the same handle once it can write.
 //
 // Matching, where a choice had to be made: a two-point trace is a finite tripwire (the path must
 // touch the segment between the points while changing side); a zone is entered when a

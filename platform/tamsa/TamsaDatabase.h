@@ -30,6 +30,11 @@ public:
 private:
     std::shared_ptr<TamsaStore> m_store;
     sqlite3* m_db = nullptr;
+    // Searches open on m_db (they use it until closed); shared with them, so a search closed
+    // after its handle (against the rules) still finds it.
+    const std::shared_ptr<int> m_openSearches = std::make_shared<int>(0);
+    // The last ingest failed or m_db could not be made: the next one starts on a new connection.
+    bool m_reconnect = false;
 };
 
 } // namespace tamsa

@@ -61,11 +61,17 @@ struct RawHit
 
 } // namespace
 
-TamsaSearch::TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQuery query)
+TamsaSearch::TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQuery query,
+                         std::shared_ptr<int> openCount)
     : m_store(std::move(store))
     , m_db(db)
     , m_query(std::move(query))
-{}
+    , m_openCount(std::move(openCount))
+{
+    if (m_openCount) {
+        ++*m_openCount;
+    }
+}
 
 TamsaSearch::~TamsaSearch()
 {
@@ -76,6 +82,9 @@ TamsaSearch::~TamsaSearch()
         sqlite3_finalize(cursor.statement);
     }
     sqlite3_finalize(m_byRowId);
+    if (m_openCount) {
+        --*m_openCount;
+    }
 }
 
 int32_t TamsaSearch::next(TTAMSA_OBJECTMETAINFO_RESULT* result)

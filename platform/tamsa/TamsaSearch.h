@@ -26,7 +26,9 @@ constexpr float kScoreThreshold = 0.5f;
 class TamsaSearch
 {
 public:
-    TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQuery query);
+    // `openCount`, when given, counts this search while it lives.
+    TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQuery query,
+                std::shared_ptr<int> openCount = nullptr);
     ~TamsaSearch();
     TamsaSearch(const TamsaSearch&) = delete;
     TamsaSearch& operator=(const TamsaSearch&) = delete;
@@ -68,6 +70,7 @@ private:
     const std::shared_ptr<TamsaStore> m_store;
     sqlite3* const m_db;
     const TamsaQuery m_query;
+    const std::shared_ptr<int> m_openCount;
     std::atomic<bool> m_aborted{false};
 
     bool m_started = false;

@@ -5,6 +5,7 @@
 
 #include <sqlite3.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <deque>
@@ -106,6 +107,31 @@ private:
     int m_fd;
 };
 
+// The lock serialises writers only, so a read-only descriptor (all a read-only directory
+// allows) serves as well; -1 when the file can be neither made nor opened.
+int openLockFile(const std::string& directory)
+{
+    const std::string path = directory + "/tamsa.lock";
+    const int fd = ::open(path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    return fd >= 0 ? fd : ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
+}
+
+// A file name as the path of an SQLite URI.
+std::string uriPath(const std::string& path)
+{
+    std::string uri;
+    for (char c : path) {
+        if (c == '%' || c == '?' || c == '#') {
+            char escaped[4];
+            std::snprintf(escaped, sizeof escaped, "%%%02X", unsigned(static_cast<unsigned char>(c)));
+            uri += escaped;
+        } else {
+            uri += c;
+        }
+    }
+    return uri;
+}
+
 } // namespace
 
 static bool fullSyncWanted()
@@ -141,15 +167,18 @@ std::shared_ptr<TamsaStore> TamsaStore::open(const std::string& directory, int32
     std::shared_ptr<TamsaStore> store = g_registry[key].lock();
     if (!store) {
         store.reset(new TamsaStore(key));
-        store->m_lockFd = ::open((key + "/tamsa.lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+        store->m_lockFd = openLockFile(key);
         sqlite3* db = store->connect(status);
-        if (!db || store->m_lockFd < 0) {
-            sqlite3_close(db);
+        if (!db) {
             *status = TAMSA_E_IO;
             return nullptr;
         }
         bool ok = false;
-        {
+        if (sqlite3_db_readonly(db, "main") == 1) {
+            // A read-only directory still serves searches from what it holds; ingest fails
+            // until it is writable again (see ingest).
+            ok = true;
+        } else if (store->m_lockFd >= 0) {
             WriteLock lock(store->m_lockFd);
             ok = exec(db, "PRAGMA journal_mode=WAL") && exec(db, kSchema);
         }
@@ -183,6 +212,24 @@ sqlite3* TamsaStore::connect(int32_t* status) const
         sqlite3_close(db);
         *status = TAMSA_E_IO;
         return nullptr;
+    }
+    // The log and its index outlive the last connection: a reader of a read-only directory
+    // cannot create them, and without them SQLite cannot read a WAL database at all.
+    int persistWal = 1;
+    sqlite3_file_control(db, "main", SQLITE_FCNTL_PERSIST_WAL, &persistWal);
+    if (sqlite3_db_readonly(db, "main") == 1 && !exec(db, "SELECT 1 FROM sqlite_master LIMIT 1")) {
+        // Read-only and left without them (by an older writer): nobody can write there now,
+        // so the file is read as it is.
+        sqlite3_close(db);
+        db = nullptr;
+        if (sqlite3_open_v2(("file:" + uriPath(path) + "?immutable=1").c_str(), &db,
+                            SQLITE_OPEN_READONLY | SQLITE_OPEN_URI | SQLITE_OPEN_NOMUTEX,
+                            nullptr) != SQLITE_OK ||
+            !exec(db, "SELECT 1 FROM sqlite_master LIMIT 1")) {
+            sqlite3_close(db);
+            *status = TAMSA_E_IO;
+            return nullptr;
+        }
     }
     sqlite3_busy_timeout(db, 30000);
     exec(db, m_fullSync ? "PRAGMA synchronous=FULL" : "PRAGMA synchronous=NORMAL");
@@ -240,6 +287,12 @@ int32_t TamsaStore::ingest(sqlite3* db, int32_t groupId, uint32_t location, std:
     }
 
     std::lock_guard<std::mutex> writeLock(m_writeMutex);
+    if (m_lockFd < 0) {
+        m_lockFd = openLockFile(m_directory); // the directory was read-only when the store opened
+        if (m_lockFd < 0) {
+            return TAMSA_E_IO;
+        }
+    }
     WriteLock fileLock(m_lockFd);
     TamsaFeatureFile* bodyFile = writer(location, FeatureKind::Body);
     TamsaFeatureFile* faceFile = writer(location, FeatureKind::Face);
@@ -247,7 +300,7 @@ int32_t TamsaStore::ingest(sqlite3* db, int32_t groupId, uint32_t location, std:
         return TAMSA_E_IO;
     }
     if (!exec(db, "BEGIN IMMEDIATE")) {
-        return TAMSA_E_BUSY;
+        return sqlite3_errcode(db) == SQLITE_BUSY ? TAMSA_E_BUSY : TAMSA_E_IO;
     }
     Statement upsert(db, kUpsert);
     Statement maxDuration(db, kMaxDuration);

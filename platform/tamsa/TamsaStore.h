@@ -61,7 +61,7 @@ private:
 
     const std::string m_directory;
     const bool m_fullSync;
-    int m_lockFd = -1;
+    int m_lockFd = -1; // -1 while the directory allows no lock file; retried under m_writeMutex
 
     std::mutex m_writeMutex;
     std::map<std::pair<uint32_t, int>, std::unique_ptr<TamsaFeatureFile>>

@@ -614,6 +614,64 @@ TEST_F(CaseDatabaseTest, KilledWriterLosesNoAcknowledgedWrite)
     EXPECT_GE(acknowledged, 80);
 }
 
+TEST_F(CaseDatabaseTest, FullFolderRefusesWritesAndKeepsEarlierCases)
+{
+    QProcess writer;
+    writer.start(CASE_VAULT_PROBE, {"full", m_dir.path()});
+    ASSERT_TRUE(writer.waitForFinished(120000));
+    const QByteArray output = writer.readAllStandardOutput();
+    ASSERT_EQ(writer.exitStatus(), QProcess::NormalExit) << "the writer crashed";
+    ASSERT_EQ(writer.exitCode(), 0) << output.constData();
+
+    // What the writer was told, by round: a case id and an item id, 0 for refused.
+    QMap<int, int> caseOfRound;
+    QMap<int, int> itemOfRound;
+    int refused = 0;
+    int lastRound = -1;
+    for (const QByteArray& line : output.split('\n')) {
+        const QList<QByteArray> words = line.split(' ');
+        if (words.size() < 3) {
+            continue;
+        }
+        if (words.at(0) == "case") {
+            lastRound = words.at(2).toInt();
+            caseOfRound.insert(lastRound, words.at(1).toInt());
+            refused += words.at(1).toInt() == 0;
+        } else if (words.at(0) == "item" && words.size() == 4) {
+            itemOfRound.insert(words.at(3).toInt(), words.at(1).toInt());
+            refused += words.at(1).toInt() == 0;
+        } else if (words.at(0) == "read") {
+            EXPECT_EQ(words.at(2).toInt(), 1) << "a full folder must still read: " << line.constData();
+        }
+    }
+    EXPECT_GE(refused, 5) << "the limit never refused a write:\n" << output.constData();
+    ASSERT_GT(caseOfRound.value(lastRound), 0) << "no case once there was room again";
+    EXPECT_GT(itemOfRound.value(lastRound), 0) << "no item once there was room again";
+
+    // A fresh instance holds exactly what was acknowledged, as it was sent.
+    CaseDatabase reopened(m_dir.path());
+    int acknowledgedCases = 0;
+    for (auto it = caseOfRound.cbegin(); it != caseOfRound.cend(); ++it) {
+        if (it.value() <= 0) {
+            continue;
+        }
+        ++acknowledgedCases;
+        EXPECT_EQ(reopened.getCaseInfoMap(it.value()).value(KEY_CASE_NAME).toString(),
+                  QStringLiteral("full case %1").arg(it.key()));
+        const int itemId = itemOfRound.value(it.key());
+        const QSet<int> items = reopened.getCaseItemIdSet(it.value());
+        EXPECT_EQ(items, itemId > 0 ? QSet<int>{itemId} : QSet<int>{}) << "round " << it.key();
+        if (itemId > 0) {
+            const QVariantMap stored = reopened.getCaseItemInfoMap(itemId);
+            EXPECT_EQ(stored.value(KEY_START_TIMESTAMP).toLongLong(), qint64(it.key()) * 1000 + 1);
+            EXPECT_TRUE(
+                stored.value(KEY_OBJ_IMAGE).toString().startsWith(QStringLiteral("image %1 ").arg(it.key())));
+        }
+    }
+    EXPECT_EQ(reopened.getAllCase().size(), acknowledgedCases) << "a refused case was stored after all";
+    EXPECT_EQ(raw(QStringLiteral("PRAGMA integrity_check")).value(0).toString(), QStringLiteral("ok"));
+}
+
 TEST_F(CaseDatabaseTest, FreshProcessReadsWhatThisOneWrote)
 {
     CaseDatabase vault(m_dir.path());

@@ -6,7 +6,12 @@
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size);
 
-TEST(CorpusReplay, EveryCorpusInputRunsClean)
+// One suite name per target (CorpusReplay_<target>), so that each replay has a test name of its own.
+#ifndef FUZZ_REPLAY_SUITE
+#define FUZZ_REPLAY_SUITE CorpusReplay
+#endif
+
+TEST(FUZZ_REPLAY_SUITE, EveryCorpusInputRunsClean)
 {
     const QDir corpus(QStringLiteral(FUZZ_CORPUS_DIR));
     const QStringList files = corpus.entryList(QDir::Files);

@@ -241,6 +241,12 @@ int NovirConfigServer::ingestedObjects() const
     return m_ingestedObjects;
 }
 
+int NovirConfigServer::failedIngests() const
+{
+    QMutexLocker locker(&m_mutex);
+    return m_failedIngests;
+}
+
 void NovirConfigServer::flush()
 {
     if (!m_thread.isRunning() || QThread::currentThread() == &m_thread) {
@@ -481,6 +487,8 @@ NovirConfigServer::Part NovirConfigServer::ingestMetaInfo(const QString& content
     }
     const int32_t stored = Tamsa_PutObjectMetaInfo(m_store, groupId, locationNumber, info.constData());
     if (stored < 0) {
+        QMutexLocker locker(&m_mutex);
+        ++m_failedIngests;
         return Part{false, kFailed, QString()};
     }
     {

@@ -56,6 +56,8 @@ public:
     NovirSite site() const;
     int answeredCount(const QString& cmdName) const;
     int ingestedObjects() const;
+    // Answers the store refused (a read-only or full storage directory, ...).
+    int failedIngests() const;
     // Blocks until the server thread has worked off everything posted to it before this call.
     void flush();
 
@@ -122,5 +124,6 @@ private:
     QList<NSNovirTunnelClient::EventHandler> m_statusSubscribers;                   // guarded by m_mutex
     QHash<QString, int> m_answered;                                                 // guarded by m_mutex
     int m_ingestedObjects = 0;                                                      // guarded by m_mutex
+    int m_failedIngests = 0;                                                        // guarded by m_mutex
     void* m_store = nullptr; // used on the server thread only, after openStore
 };

@@ -274,15 +274,26 @@ TEST_F(TamsaStorageFaultTest, FullDirectoryRefusesIngestWithoutLosingAcknowledge
             acknowledged.insert(id);
         }
 
-        // Limits from "nothing may grow" to a few pages more: each batch stops at a different
-        // write (vectors, row records, the log, the commit), or fits.
+        // Limits from "nothing may be written" and "nothing may grow" to a few pages more: each
+        // batch stops at a different write (vectors, row records, the log, the commit), or fits.
         int failures = 0;
         uint64_t nextId = 1000;
-        for (int64_t extra : {0, 0, 1024, 4096, 9000, 20000, 40000, 70000, 0, 2048, 16000, 100000}) {
-            const rlimit limit{rlim_t(largestFile(store) + extra), unlimited.rlim_max};
+        // -1: no write at all.
+        for (int64_t extra : {-1, 0, 0, 1024, 4096, 9000, 20000, 40000, 70000, 0, 2048, 16000, 100000, -1}) {
+            const rlimit limit{extra < 0 ? 0 : rlim_t(largestFile(store) + extra), unlimited.rlim_max};
             EXPECT_EQ(::setrlimit(RLIMIT_FSIZE, &limit), 0);
             const std::vector<ObjectSpec> batch = objects(nextId, 12);
             const int32_t result = putOn(database, batch);
+            if (result < 0) {
+                // Searches answer while the directory is full, on this handle and on a new one.
+                expectStored(database, acknowledged);
+                void* another = openOn(store);
+                EXPECT_NE(another, nullptr) << "no handle while the directory is full";
+                if (another) {
+                    expectStored(another, acknowledged);
+                    Tamsa_ReleaseDatabase(&another);
+                }
+            }
             EXPECT_EQ(::setrlimit(RLIMIT_FSIZE, &unlimited), 0);
             if (result < 0) {
                 ++failures;
@@ -294,7 +305,6 @@ TEST_F(TamsaStorageFaultTest, FullDirectoryRefusesIngestWithoutLosingAcknowledge
                 }
             }
             nextId += 100;
-            // Searches answer in between, from exactly what was acknowledged.
             expectStored(database, acknowledged);
         }
         EXPECT_GE(failures, 2) << "the limit never made a write fail";

@@ -13,11 +13,15 @@
 #include <QCoreApplication>
 #include <QDir>
 #include <QElapsedTimer>
+#include <QFileInfo>
 #include <QMutex>
+#include <QProcess>
 #include <QTemporaryDir>
 #include <QThread>
+#include <csignal>
 #include <gtest/gtest.h>
 #include <memory>
+#include <sys/resource.h>
 #include <thread>
 #include <vector>
 
@@ -520,6 +524,106 @@ TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
         }
     }
     EXPECT_EQ(stored, acknowledged);
+}
+
+// The file-size limit stays in a second process of this program: it runs the disabled test below.
+TEST(PluginCasesFullVault, CommandsAnswerFailureNeverSuccessAndEarlierCasesSurvive)
+{
+    QProcess child;
+    child.setProcessChannelMode(QProcess::MergedChannels);
+    child.start(QCoreApplication::applicationFilePath(),
+                {QStringLiteral("--gtest_also_run_disabled_tests"),
+                 QStringLiteral("--gtest_filter=PluginCasesTest.DISABLED_FullVaultFolderInThisProcess")});
+    ASSERT_TRUE(child.waitForFinished(120000));
+    const QByteArray output = child.readAll();
+    EXPECT_EQ(child.exitStatus(), QProcess::NormalExit) << output.constData();
+    EXPECT_EQ(child.exitCode(), 0) << output.constData();
+    EXPECT_TRUE(output.contains("[  PASSED  ] 1 test")) << output.constData();
+}
+
+TEST_F(PluginCasesTest, DISABLED_FullVaultFolderInThisProcess)
+{
+    auto finalOf = [](ReplyRecorder& recorder) {
+        EXPECT_EQ(recorder.finalCount(), 1);
+        return recorder.last();
+    };
+    // Items are told apart by their start; big images make every few of them need a new page.
+    qint64 nextStart = 1700000000000;
+    auto bigItem = [&nextStart]() {
+        QVariantMap entry = item(QStringLiteral("cam1"), false, nextStart += 1000);
+        entry.insert(KEY_OBJ_IMAGE, QString(3000, QLatin1Char('i')));
+        return entry;
+    };
+    QMap<int, QString> acknowledgedCases; // id -> name
+    QList<qint64> acknowledgedItems;      // starts
+    auto addCase = [&](const QString& name) {
+        const QVariantMap entry = bigItem();
+        const Reply reply =
+            finalOf(call(CMD_ADD_CASE_WITH_ITEM, QVariantMap{{KEY_CASE_NAME, name}, {KEY_CASE_ITEM, entry}}));
+        if (reply.strCode == RC_SUCCESS) {
+            acknowledgedCases.insert(reply.payload.toMap().value(KEY_CASE_ID).toInt(), name);
+            acknowledgedItems.append(entry.value(KEY_START_TIMESTAMP).toLongLong());
+        }
+        return reply.strCode == RC_SUCCESS;
+    };
+    for (int c = 0; c < 3; ++c) {
+        ASSERT_TRUE(addCase(QStringLiteral("before %1").arg(c)));
+    }
+    const int firstCase = acknowledgedCases.firstKey();
+
+    // Full: the vault file may not grow; writes past its size fail with EFBIG.
+    std::signal(SIGXFSZ, SIG_IGN);
+    rlimit unlimited{};
+    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &unlimited), 0);
+    const QString file = m_dir.filePath(QStringLiteral("db/PluginDelvix/CaseVault.db"));
+    const rlimit full{rlim_t(QFileInfo(file).size()), unlimited.rlim_max};
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &full), 0);
+    int refused = 0;
+    for (int round = 0; round < 40; ++round) {
+        refused += addCase(QStringLiteral("while full %1").arg(round)) ? 0 : 1;
+        QVariantMap entry = bigItem();
+        entry.insert(KEY_CASE_ID, firstCase);
+        if (finalOf(call(CMD_ADD_CASE_ITEM, entry)).strCode == RC_SUCCESS) {
+            acknowledgedItems.append(entry.value(KEY_START_TIMESTAMP).toLongLong());
+        } else {
+            ++refused;
+        }
+        // Reads keep answering.
+        const Reply list = finalOf(call(CMD_GET_CASE_LIST, QVariant()));
+        EXPECT_EQ(list.strCode, RC_SUCCESS);
+        EXPECT_GE(list.payload.toList().size(), 3);
+    }
+    EXPECT_GE(refused, 5) << "the limit refused nothing";
+    const Reply model = finalOf(call(CMD_RETRIEVE_CASE_ITEM_MODEL, firstCase));
+    EXPECT_EQ(model.strCode, RC_SUCCESS);
+
+    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &unlimited), 0);
+    EXPECT_TRUE(addCase(QStringLiteral("room again"))) << "writes did not resume";
+
+    // What a fresh instance reads: every acknowledged case and item.
+    CaseDatabase reopened(m_dir.filePath(QStringLiteral("db")));
+    QSet<qint64> storedStarts;
+    for (const QVariant& record : reopened.getAllCase()) {
+        const int caseId = record.toMap().value(KEY_CASE_ID).toInt();
+        const QString name = record.toMap().value(KEY_CASE_NAME).toString();
+        if (!acknowledgedCases.contains(caseId)) {
+            // Answered failure: the case row went in before its item was refused, and stays
+            // (as with any item failure); its item must not be there.
+            EXPECT_TRUE(name.startsWith(QStringLiteral("while full"))) << qPrintable(name);
+            EXPECT_TRUE(reopened.getCaseItemList(caseId).isEmpty()) << qPrintable(name);
+            continue;
+        }
+        EXPECT_EQ(name, acknowledgedCases.value(caseId));
+        for (const QVariant& stored : reopened.getCaseItemList(caseId)) {
+            storedStarts.insert(stored.toMap().value(KEY_START_TIMESTAMP).toLongLong());
+        }
+    }
+    for (auto it = acknowledgedCases.cbegin(); it != acknowledgedCases.cend(); ++it) {
+        EXPECT_TRUE(reopened.containCase(it.key())) << qPrintable(it.value());
+    }
+    for (qint64 start : acknowledgedItems) {
+        EXPECT_TRUE(storedStarts.contains(start)) << "the item starting " << start << " is missing";
+    }
 }
 
 #include "PluginDelvixSrvCasesTest.moc"

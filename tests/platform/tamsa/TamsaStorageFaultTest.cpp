@@ -207,19 +207,27 @@ TEST_F(TamsaStorageFaultTest, ReadOnlyDirectoryServesSearchesAndIngestResumesWhe
             return std::string("cannot mount a tmpfs: ") + std::strerror(errno);
         }
         const std::string store = mountPoint + "/Server";
-        // Filled by a grandchild, so that this process meets the directory first while it is
-        // read-only (and holds no file of it open for writing, which would keep it writable).
+        const std::string bare = mountPoint + "/Bare";
+        // Filled by a grandchild, so that this process meets the directories first while they
+        // are read-only (and holds no file there open for writing, which would keep them writable).
         const pid_t filler = ::fork();
         if (filler == 0) {
-            void* database = openOn(store);
-            const bool ok = database && putOn(database, objects(1, 30)) == 30;
-            Tamsa_ReleaseDatabase(&database);
+            bool ok = true;
+            for (const std::string& directory : {store, bare}) {
+                void* database = openOn(directory);
+                ok = ok && database && putOn(database, objects(1, 30)) == 30;
+                Tamsa_ReleaseDatabase(&database);
+            }
             std::fflush(stdout);
             ::_exit(ok ? 0 : 1);
         }
         int status = 0;
         EXPECT_EQ(::waitpid(filler, &status, 0), filler);
-        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "filling the store failed";
+        EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "filling the stores failed";
+        // A store whose writers left no log files behind (all is in the database file then).
+        for (const char* leftover : {"/tamsa.db-wal", "/tamsa.db-shm"}) {
+            std::filesystem::remove(bare + leftover);
+        }
         EXPECT_TRUE(remount(mountPoint, true)) << std::strerror(errno);
         std::set<uint64_t> stored;
         for (uint64_t id = 1; id <= 30; ++id) {
@@ -232,6 +240,12 @@ TEST_F(TamsaStorageFaultTest, ReadOnlyDirectoryServesSearchesAndIngestResumesWhe
             return std::string();
         }
         expectStored(database, stored);
+        void* bareDatabase = openOn(bare);
+        EXPECT_NE(bareDatabase, nullptr) << "a read-only store without log files must open too";
+        if (bareDatabase) {
+            expectStored(bareDatabase, stored);
+            EXPECT_LT(putOn(bareDatabase, objects(100, 5)), 0);
+        }
         for (int attempt = 0; attempt < 3; ++attempt) {
             const int32_t result = putOn(database, objects(100 + uint64_t(attempt) * 10, 5));
             EXPECT_LT(result, 0) << "ingest into a read-only directory must fail, not count";
@@ -240,11 +254,18 @@ TEST_F(TamsaStorageFaultTest, ReadOnlyDirectoryServesSearchesAndIngestResumesWhe
 
         EXPECT_TRUE(remount(mountPoint, false)) << std::strerror(errno);
         EXPECT_EQ(putOn(database, objects(200, 12)), 12) << "ingest resumes on the same handle";
+        if (bareDatabase) {
+            EXPECT_EQ(putOn(bareDatabase, objects(200, 12)), 12) << "and on the bare store's handle";
+        }
         for (uint64_t id = 200; id < 212; ++id) {
             stored.insert(id);
         }
         expectStored(database, stored);
         Tamsa_ReleaseDatabase(&database);
+        if (bareDatabase) {
+            expectStored(bareDatabase, stored);
+            Tamsa_ReleaseDatabase(&bareDatabase);
+        }
 
         void* fresh = openOn(store);
         EXPECT_NE(fresh, nullptr);

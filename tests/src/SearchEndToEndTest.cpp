@@ -7,19 +7,26 @@
 #include "TamsaSeeder.h"
 #include "TamsaWrapper.h"
 
+#include <QCoreApplication>
 #include <QDir>
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
+#include <QProcess>
 #include <QSettings>
 #include <QTemporaryDir>
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
 #include <chrono>
 #include <condition_variable>
+#include <cstring>
 #include <mutex>
+#include <sched.h>
 #include <set>
+#include <sys/mount.h>
+#include <unistd.h>
 
 namespace {
 
@@ -245,4 +252,51 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
     }
     EXPECT_EQ(found.size(), hits.size()); // no duplicates
     EXPECT_EQ(found, expected);
+}
+
+// The mounts stay in a second process of this program: it runs the disabled test below.
+TEST(SearchEndToEndReadOnly, SearchesAnswerFromAReadOnlyStore)
+{
+    QProcess child;
+    child.setProcessChannelMode(QProcess::MergedChannels);
+    child.start(QCoreApplication::applicationFilePath(),
+                {QStringLiteral("--gtest_also_run_disabled_tests"),
+                 QStringLiteral("--gtest_filter=SearchEndToEndTest.DISABLED_ReadOnlyStoreInThisProcess")});
+    ASSERT_TRUE(child.waitForFinished(240000));
+    const QByteArray output = child.readAll();
+    if (output.contains("[  SKIPPED ] 1 test")) {
+        GTEST_SKIP() << output.constData();
+    }
+    EXPECT_EQ(child.exitStatus(), QProcess::NormalExit) << output.constData();
+    EXPECT_EQ(child.exitCode(), 0) << output.constData();
+    EXPECT_TRUE(output.contains("[  PASSED  ] 1 test")) << output.constData();
+}
+
+TEST_F(SearchEndToEndTest, DISABLED_ReadOnlyStoreInThisProcess)
+{
+    // The store folder becomes a read-only view of itself in a mount namespace of this process
+    // (chmod binds nobody when the tests run as root).
+    const QByteArray store = QDir(s_data->path()).filePath(QStringLiteral("Server")).toUtf8();
+    if (::unshare(CLONE_NEWNS) != 0) {
+        GTEST_SKIP() << "no mount namespace: " << std::strerror(errno);
+    }
+    ASSERT_EQ(::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr), 0) << std::strerror(errno);
+    ASSERT_EQ(::mount(store.constData(), store.constData(), nullptr, MS_BIND, nullptr), 0)
+        << std::strerror(errno);
+    ASSERT_EQ(::mount(nullptr, store.constData(), nullptr, MS_REMOUNT | MS_BIND | MS_RDONLY, nullptr), 0)
+        << std::strerror(errno);
+    ASSERT_NE(::access((store + "/tamsa.db").constData(), W_OK), 0) << "the store is still writable";
+
+    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc2"}},
+                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
+                                                                 {KEY_END_TIMESTAMP, windowEndMs()}});
+    EXPECT_EQ(hits.size(), 201u);
+    const tamsa::TamsaSeeder seeder(s_options);
+    const uint32_t identity = seeder.identityOf(1, 0) == 0 ? 1 : seeder.identityOf(1, 0);
+    const std::vector<QVariantMap> sightings =
+        run(CMD_START_REID_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc1", "Loc2"}},
+                                    {KEY_START_TIMESTAMP, windowStartMs()},
+                                    {KEY_END_TIMESTAMP, windowEndMs()},
+                                    {KEY_FEATURE, asList(seeder.identityBody(identity))}});
+    EXPECT_FALSE(sightings.empty());
 }

@@ -189,34 +189,41 @@ public:
         if (*m_stopped) {
             return;
         }
-        Item item;
-        item.nodeId = QStringLiteral("Cam%1").arg(m_index % 5 + 1);
-        item.locId = QStringLiteral("Loc%1").arg(m_index % 5 + 1);
-        item.start = 1704067200000LL + qint64(m_index) * 1000000000LL + qint64(++m_sequence) * 1000;
-        item.end = item.start + 30000 + m_sequence;
-        item.type = m_sequence % 2;
-        item.needBookmark = m_sequence % 5 == 0;
+        QList<Item> items{newItem()};
         QString command;
         QJsonObject params;
-        if (m_cases.isEmpty() || m_sequence % 3 == 0) {
+        if (m_cases.isEmpty() || m_sequence % 4 == 0) {
             command = QStringLiteral("addCaseWithItem");
-            item.caseName = QStringLiteral("killed host %1 case %2").arg(m_index).arg(m_sequence);
-            params = {{QStringLiteral("caseName"), item.caseName},
+            items[0].caseName = QStringLiteral("killed host %1 case %2").arg(m_index).arg(m_sequence);
+            params = {{QStringLiteral("caseName"), items[0].caseName},
                       {QStringLiteral("reporter"), QStringLiteral("writer %1").arg(m_index)},
-                      {QStringLiteral("caseItem"), itemJson(item)}};
+                      {QStringLiteral("caseItem"), itemJson(items[0])}};
+        } else if (m_sequence % 4 == 1) {
+            // A case made with two recordings at once.
+            command = QStringLiteral("addCaseWithRecordings");
+            items << newItem();
+            QJsonArray list;
+            for (Item& item : items) {
+                item.caseName = QStringLiteral("killed host %1 recordings %2").arg(m_index).arg(m_sequence);
+                item.type = 1;
+                list.append(itemJson(item));
+            }
+            params = {{QStringLiteral("caseName"), items[0].caseName},
+                      {QStringLiteral("reporter"), QStringLiteral("writer %1").arg(m_index)},
+                      {QStringLiteral("caseItem"), list}};
         } else {
             command = QStringLiteral("addCaseItem");
             const Item& owner = m_cases.at(m_sequence % int(m_cases.size()));
-            item.caseId = owner.caseId;
-            item.caseName = owner.caseName;
-            params = itemJson(item);
-            params.insert(QStringLiteral("caseId"), item.caseId);
+            items[0].caseId = owner.caseId;
+            items[0].caseName = owner.caseName;
+            params = itemJson(items[0]);
+            params.insert(QStringLiteral("caseId"), owner.caseId);
         }
         m_busy = true;
         const std::shared_ptr<Answer> answer =
             post(*m_network, m_port, command, QStringLiteral("writer-%1").arg(m_index), params);
         QTimer* poll = new QTimer;
-        QObject::connect(poll, &QTimer::timeout, poll, [this, answer, item, command, poll]() mutable {
+        QObject::connect(poll, &QTimer::timeout, poll, [this, answer, items, command, poll]() mutable {
             if (!answer->done) {
                 return;
             }
@@ -226,14 +233,17 @@ public:
             if (!finalLine(*answer, &line)) {
                 ++*m_cutShort;
             } else if (line.value(QStringLiteral("code")).toString() == QLatin1String("0")) {
-                if (command == QLatin1String("addCaseWithItem")) {
-                    item.caseId = line.value(QStringLiteral("payload"))
-                                      .toObject()
-                                      .value(QStringLiteral("caseId"))
-                                      .toInt();
-                    m_cases << item;
+                if (command != QLatin1String("addCaseItem")) {
+                    const int caseId = line.value(QStringLiteral("payload"))
+                                           .toObject()
+                                           .value(QStringLiteral("caseId"))
+                                           .toInt();
+                    for (Item& item : items) {
+                        item.caseId = caseId;
+                    }
+                    m_cases << items[0];
                 }
-                m_acknowledged->append(item);
+                *m_acknowledged << items;
             }
             m_busy = false;
             m_onAnswer();
@@ -243,6 +253,18 @@ public:
     }
 
 private:
+    Item newItem()
+    {
+        Item item;
+        item.nodeId = QStringLiteral("Cam%1").arg(m_index % 5 + 1);
+        item.locId = QStringLiteral("Loc%1").arg(m_index % 5 + 1);
+        item.start = 1704067200000LL + qint64(m_index) * 1000000000LL + qint64(++m_sequence) * 1000;
+        item.end = item.start + 30000 + m_sequence;
+        item.type = m_sequence % 2;
+        item.needBookmark = m_sequence % 5 == 0;
+        return item;
+    }
+
     const int m_index;
     QNetworkAccessManager* m_network;
     const quint16 m_port;

@@ -3,8 +3,9 @@
 // feature files (one writer each) and the read-only mappings the scans use. Handles find it by
 // path, so opening a handle per search (as the plug-in does) keeps the mappings warm.
 //
-// Files in the directory: tamsa.db (SQLite, WAL), features/L<location>.<body|face>.f32 and .rows
-// (see TamsaFeatureFile), tamsa.lock.
+// Files in the directory: tamsa.db (SQLite, WAL; its -wal and -shm files stay after the last
+// connection, so that the store can be read where it cannot be written),
+// features/L<location>.<body|face>.f32 and .rows (see TamsaFeatureFile), tamsa.lock.
 //
 // Durability: an ingest returns after its data is written to the files (WAL, synchronous NORMAL),
 // so it survives a crash or kill of the process; a device sync per ingest costs tens of

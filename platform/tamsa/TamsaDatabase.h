@@ -4,6 +4,7 @@
 
 #include "Tamsa.h"
 
+#include <atomic>
 #include <memory>
 #include <string>
 
@@ -32,7 +33,8 @@ private:
     sqlite3* m_db = nullptr;
     // Searches open on m_db (they use it until closed); shared with them, so a search closed
     // after its handle (against the rules) still finds it.
-    const std::shared_ptr<int> m_openSearches = std::make_shared<int>(0);
+    // Atomic: a search may be closed on another thread than the one that ingests.
+    const std::shared_ptr<std::atomic<int>> m_openSearches = std::make_shared<std::atomic<int>>(0);
     // The last ingest failed or m_db could not be made: the next one starts on a new connection.
     bool m_reconnect = false;
 };

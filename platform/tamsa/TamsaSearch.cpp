@@ -62,7 +62,7 @@ struct RawHit
 } // namespace
 
 TamsaSearch::TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQuery query,
-                         std::shared_ptr<int> openCount)
+                         std::shared_ptr<std::atomic<int>> openCount)
     : m_store(std::move(store))
     , m_db(db)
     , m_query(std::move(query))

@@ -28,7 +28,7 @@ class TamsaSearch
 public:
     // `openCount`, when given, counts this search while it lives.
     TamsaSearch(std::shared_ptr<TamsaStore> store, sqlite3* db, TamsaQuery query,
-                std::shared_ptr<int> openCount = nullptr);
+                std::shared_ptr<std::atomic<int>> openCount = nullptr);
     ~TamsaSearch();
     TamsaSearch(const TamsaSearch&) = delete;
     TamsaSearch& operator=(const TamsaSearch&) = delete;
@@ -70,7 +70,7 @@ private:
     const std::shared_ptr<TamsaStore> m_store;
     sqlite3* const m_db;
     const TamsaQuery m_query;
-    const std::shared_ptr<int> m_openCount;
+    const std::shared_ptr<std::atomic<int>> m_openCount;
     std::atomic<bool> m_aborted{false};
 
     bool m_started = false;

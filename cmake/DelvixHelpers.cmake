@@ -54,14 +54,19 @@ function(delvix_test name)
     set(timeout ${ARG_TIMEOUT})
   endif()
   # Instrumented builds run several times slower (ThreadSanitizer most), listing the tests included.
+  # The same factor scales CTest's limit and, through DELVIX_TEST_TIME_SCALE, the waits inside the
+  # tests, so that a slow build is never mistaken for a hang.
   set(discovery 5)
+  set(scale 1)
   if(DELVIX_SANITIZE STREQUAL "thread")
-    math(EXPR timeout "${timeout} * 4")
+    set(scale 4)
     set(discovery 60)
   elseif(DELVIX_SANITIZE STREQUAL "address")
-    math(EXPR timeout "${timeout} * 2")
+    set(scale 2)
     set(discovery 60)
   endif()
+  math(EXPR timeout "${timeout} * ${scale}")
+  target_compile_definitions(${name} PRIVATE DELVIX_TEST_TIME_SCALE=${scale})
   gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT ${discovery} PROPERTIES TIMEOUT ${timeout})
 endfunction()
 

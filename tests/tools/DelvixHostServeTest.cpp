@@ -17,6 +17,12 @@
 
 namespace {
 
+// Instrumented builds run the same work several times slower; the build says how much.
+#ifndef DELVIX_TEST_TIME_SCALE
+#define DELVIX_TEST_TIME_SCALE 1
+#endif
+constexpr int kTimeScale = DELVIX_TEST_TIME_SCALE;
+
 class ServeTest : public ::testing::Test
 {
 protected:
@@ -33,7 +39,7 @@ protected:
         timer.start();
         QByteArray out;
         const QRegularExpression banner(QStringLiteral("http://127\\.0\\.0\\.1:(\\d+)"));
-        while (timer.elapsed() < 20000) {
+        while (timer.elapsed() < 20000 * kTimeScale) {
             m_process.waitForReadyRead(100);
             out += m_process.readAllStandardOutput();
             const QRegularExpressionMatch match = banner.match(QString::fromUtf8(out));
@@ -115,7 +121,7 @@ TEST_F(ServeTest, StreamsRepliesAsJsonLinesAndStopsCleanly)
     EXPECT_EQ(post(QStringLiteral("/getCaseList"), "{broken").status, 400);
 
     ::kill(pid_t(m_process.processId()), SIGTERM);
-    ASSERT_TRUE(m_process.waitForFinished(20000));
+    ASSERT_TRUE(m_process.waitForFinished(20000 * kTimeScale));
     EXPECT_EQ(m_process.exitStatus(), QProcess::NormalExit);
     EXPECT_EQ(m_process.exitCode(), 0);
     EXPECT_TRUE(m_process.readAllStandardOutput().contains("stopping after"));
@@ -128,7 +134,7 @@ TEST(ServeArguments, RefusesNonLoopbackAddressesAndBadOptions)
         QProcess process;
         process.start(QStringLiteral(DELVIX_HOST_PATH),
                       QStringList{QStringLiteral("serve"), QStringLiteral("--data"), data.path()} + extra);
-        process.waitForFinished(30000);
+        process.waitForFinished(30000 * kTimeScale);
         return std::make_pair(process.exitCode(), process.readAllStandardError());
     };
     auto [code, err] = run({QStringLiteral("--listen"), QStringLiteral("0.0.0.0:8000")});
@@ -147,7 +153,7 @@ TEST(DemoProgram, RunsTheWholeSystemAndReportsItComplete)
     QProcess process;
     process.start(QStringLiteral(DELVIX_HOST_PATH),
                   {QStringLiteral("demo"), QStringLiteral("--data"), data.filePath(QStringLiteral("demo"))});
-    ASSERT_TRUE(process.waitForFinished(110000));
+    ASSERT_TRUE(process.waitForFinished(110000 * kTimeScale));
     const QByteArray out = process.readAllStandardOutput();
     EXPECT_EQ(process.exitCode(), 0) << out.constData() << process.readAllStandardError().constData();
     EXPECT_TRUE(out.contains("demo complete")) << out.constData();

@@ -8,6 +8,9 @@
 // Sizes come from the environment, with defaults small enough for CI on two cores:
 //   DELVIX_LOAD_CLIENTS (8)  DELVIX_LOAD_SECONDS (20)  DELVIX_LOAD_OBJECTS (10000)
 //   DELVIX_LOAD_CAMERAS (0: the built-in site; N: a generated site of N cameras at Loc1..LocN)
+// Under ThreadSanitizer, which makes the server many times slower, the defaults are 4 clients
+// and 2000 objects; every client still starts with one request of each kind, so that all kinds
+// are in flight together, which is what the race detector needs to see.
 // scripts/load-test.sh runs the large variant and shows the report this test prints.
 
 #include <QCoreApplication>
@@ -47,17 +50,40 @@
 #endif
 #endif
 
+#ifndef DELVIX_TEST_TIME_SCALE
+#define DELVIX_TEST_TIME_SCALE 1
+#endif
+#if defined(__SANITIZE_THREAD__)
+#define DELVIX_LOAD_THREAD_SANITIZER 1
+#elif defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define DELVIX_LOAD_THREAD_SANITIZER 1
+#endif
+#endif
+
 namespace {
+
+// Instrumented builds do the same work several times slower; the build says how much.
+constexpr int kTimeScale = DELVIX_TEST_TIME_SCALE;
+#ifdef DELVIX_LOAD_THREAD_SANITIZER
+constexpr int kDefaultClients = 4;
+constexpr int kDefaultObjects = 2000;
+#else
+constexpr int kDefaultClients = 8;
+constexpr int kDefaultObjects = 10000;
+#endif
+// The kinds of request a client sends, in the order of its first round.
+constexpr int kRequestKinds = 6;
 
 // The seeder spreads each location's objects over four hours from this time.
 constexpr qint64 kSeedStartMs = 1704067200000LL;
 constexpr qint64 kSeedSpanMs = 4 * 3600 * 1000LL;
 // Generous: a request still open after this is a lost reply, not a slow one.
-constexpr int kRequestTimeoutMs = 120000;
+constexpr int kRequestTimeoutMs = 120000 * kTimeScale;
 // How long the API waits for a first reply before it ends an answer as one of a command that
 // sends none. Searches run one at a time, so under load a search may wait its turn for many
 // seconds: the API's default of 2 s would end its answer empty and drop its hits.
-constexpr double kFirstReplyWaitSeconds = 90.0;
+constexpr double kFirstReplyWaitSeconds = 90.0 * kTimeScale;
 
 int envInt(const char* name, int fallback)
 {
@@ -200,25 +226,42 @@ public:
 
     void run()
     {
+        // A first round of every kind, each client starting at another, so that even a short run
+        // has all kinds in flight at once; then a random mix.
+        for (int i = 0; i < kRequestKinds && QDateTime::currentMSecsSinceEpoch() < m_deadlineMs; ++i) {
+            send((m_index + i) % kRequestKinds);
+        }
         while (QDateTime::currentMSecsSinceEpoch() < m_deadlineMs) {
             const int pick = pickUpTo(100);
-            if (pick < 30) {
-                search(false);
-            } else if (pick < 45) {
-                search(true);
-            } else if (pick < 60) {
-                reIdSearch(pickUpTo(3) == 0);
-            } else if (pick < 80) {
-                addCaseWithItem();
-            } else if (pick < 92) {
-                addCaseItem();
-            } else {
-                readCases();
-            }
+            send(pick < 30 ? 0 : pick < 45 ? 1 : pick < 60 ? 2 : pick < 80 ? 3 : pick < 92 ? 4 : 5);
         }
     }
 
 private:
+    void send(int kind)
+    {
+        switch (kind) {
+        case 0:
+            search(false);
+            break;
+        case 1:
+            search(true);
+            break;
+        case 2:
+            reIdSearch(pickUpTo(3) == 0);
+            break;
+        case 3:
+            addCaseWithItem();
+            break;
+        case 4:
+            addCaseItem();
+            break;
+        default:
+            readCases();
+            break;
+        }
+    }
+
     int pickUpTo(int bound) { return std::uniform_int_distribution<int>(0, bound - 1)(m_random); }
 
     QJsonObject envelope(const QString& command, const QJsonValue& params,
@@ -614,9 +657,9 @@ bool writeFile(const QString& path, const QByteArray& content)
 
 TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
 {
-    const int clients = envInt("DELVIX_LOAD_CLIENTS", 8);
+    const int clients = envInt("DELVIX_LOAD_CLIENTS", kDefaultClients);
     const int seconds = envInt("DELVIX_LOAD_SECONDS", 20);
-    const int objects = envInt("DELVIX_LOAD_OBJECTS", 10000);
+    const int objects = envInt("DELVIX_LOAD_OBJECTS", kDefaultObjects);
     const int cameras = envInt("DELVIX_LOAD_CAMERAS", 0);
     QTemporaryDir data;
     ASSERT_TRUE(data.isValid());
@@ -632,7 +675,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
                {QStringLiteral("seed"), QStringLiteral("--data"), dataDir, QStringLiteral("--objects"),
                 QString::number(objects), QStringLiteral("--locations"), QString::number(clients),
                 QStringLiteral("--seed"), QStringLiteral("7")});
-    ASSERT_TRUE(seed.waitForFinished(1800000));
+    ASSERT_TRUE(seed.waitForFinished(1800000 * kTimeScale));
     ASSERT_EQ(seed.exitCode(), 0) << seed.readAllStandardError().constData();
     const qint64 seedMs = seedTimer.elapsed();
 
@@ -669,7 +712,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     QElapsedTimer startTimer;
     startTimer.start();
     const QRegularExpression bannerPort(QStringLiteral("http://127\\.0\\.0\\.1:(\\d+)"));
-    while (port == 0 && startTimer.elapsed() < 30000 && serve.state() == QProcess::Running) {
+    while (port == 0 && startTimer.elapsed() < 30000 * kTimeScale && serve.state() == QProcess::Running) {
         serve.waitForReadyRead(100);
         banner += serve.readAllStandardOutput();
         port = bannerPort.match(QString::fromUtf8(banner)).captured(1).toUShort();
@@ -716,7 +759,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     for (const auto& thread : threads) {
         while (!thread->wait(QDeadlineTimer(50))) {
             QCoreApplication::processEvents();
-            if (QDateTime::currentMSecsSinceEpoch() > deadlineMs + kRequestTimeoutMs + 60000) {
+            if (QDateTime::currentMSecsSinceEpoch() > deadlineMs + kRequestTimeoutMs + 60000 * kTimeScale) {
                 allJoined = false;
                 break;
             }
@@ -776,7 +819,7 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     const qint64 endRssKb = procStatusKb(pid, "VmRSS");
     const qint64 peakRssKb = procStatusKb(pid, "VmHWM");
     ::kill(pid_t(pid), SIGTERM);
-    ASSERT_TRUE(serve.waitForFinished(60000)) << "the server did not stop on SIGTERM";
+    ASSERT_TRUE(serve.waitForFinished(60000 * kTimeScale)) << "the server did not stop on SIGTERM";
     EXPECT_EQ(serve.exitStatus(), QProcess::NormalExit);
     EXPECT_EQ(serve.exitCode(), 0);
     const QRegularExpressionMatch servedMatch =
@@ -855,6 +898,11 @@ TEST(LoadTest, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     EXPECT_EQ(total.finals + total.silentEnds, total.sent);
     EXPECT_GT(total.hits, 0);
     EXPECT_GT(total.cases.size(), 0);
+    // Every kind of request was in the mix.
+    EXPECT_GT(total.searches, 0);
+    EXPECT_GT(total.stoppedSearches, 0);
+    EXPECT_GT(total.reIdSearches, 0);
+    EXPECT_GT(total.items.size(), 0);
     EXPECT_GE(servedByServer, total.sent);
 #ifndef DELVIX_LOAD_INSTRUMENTED
     // Flat memory, with room for caches and allocator slack: no steady growth with the requests.

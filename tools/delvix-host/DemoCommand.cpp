@@ -18,6 +18,8 @@
 #include <QThread>
 #include <QTimer>
 #include <cstdio>
+#include <memory>
+#include <mutex>
 
 namespace {
 
@@ -37,31 +39,44 @@ struct StepTime
     int results = 0;
 };
 
-// Sends one request and collects its replies until the final one (or the time-out).
+// Sends one request and collects its replies until the final one (or the time-out). Replies come
+// from the plug-in's threads, perhaps after the time-out, so they go into a list both sides share
+// under a lock: nothing of this call's frame is touched once it has returned, and the lock orders
+// each payload before it is read here (Qt's event queue orders it too, but invisibly to
+// ThreadSanitizer).
 QList<Reply> request(PluginHost& host, const QString& command, const QVariant& params, int timeoutMs = 15000)
 {
-    QEventLoop loop;
-    QObject context;
-    QList<Reply> replies;
-    HDLR_DO_REQUEST_CB reply = [&context, &loop, &replies](bool bFinal, const QString& strCode,
-                                                           const QString&, const QVariant& payload) {
-        QMetaObject::invokeMethod(
-            &context,
-            [&loop, &replies, bFinal, strCode, payload]() {
-                replies.append({bFinal, strCode, payload});
-                if (bFinal) {
-                    loop.quit();
-                }
-            },
-            Qt::QueuedConnection);
+    struct Collected
+    {
+        std::mutex mutex;
+        QList<Reply> replies; // guarded by mutex
+        bool bFinal = false;  // guarded by mutex
+    };
+    auto collected = std::make_shared<Collected>();
+    HDLR_DO_REQUEST_CB reply = [collected](bool bFinal, const QString& strCode, const QString&,
+                                           const QVariant& payload) {
+        std::lock_guard<std::mutex> lock(collected->mutex);
+        collected->replies.append({bFinal, strCode, payload});
+        collected->bFinal = collected->bFinal || bFinal;
     };
     RequestSenderInfo sender;
     sender.strSenderName = QStringLiteral("delvix-host demo");
     sender.senderHandle = &g_demoClient;
     host.request(command, params, sender, reply);
-    QTimer::singleShot(timeoutMs, &loop, &QEventLoop::quit);
+    QElapsedTimer timer;
+    timer.start();
+    QEventLoop loop;
+    QTimer tick;
+    QObject::connect(&tick, &QTimer::timeout, &loop, [&]() {
+        std::lock_guard<std::mutex> lock(collected->mutex);
+        if (collected->bFinal || timer.elapsed() >= timeoutMs) {
+            loop.quit();
+        }
+    });
+    tick.start(5);
     loop.exec();
-    return replies;
+    std::lock_guard<std::mutex> lock(collected->mutex);
+    return collected->replies;
 }
 
 QList<QVariantMap> hitsOf(const QList<Reply>& replies)

@@ -19,12 +19,9 @@
 #include <set>
 #include <thread>
 
-namespace {
+using namespace Qt::StringLiterals;
 
-QJsonObject parseObject(const std::optional<std::string>& text)
-{
-    return text ? QJsonDocument::fromJson(QByteArray::fromStdString(*text)).object() : QJsonObject();
-}
+namespace {
 
 std::string thumbnails(const QJsonObject& object)
 {
@@ -33,7 +30,7 @@ std::string thumbnails(const QJsonObject& object)
 
 QJsonObject crop(const QString& image, const QJsonArray& feature)
 {
-    return QJsonObject{{QStringLiteral("image"), image}, {QStringLiteral("feature"), feature}};
+    return QJsonObject{{u"image"_s, image}, {u"feature"_s, feature}};
 }
 
 FakeObject person(uint64_t id, uint32_t location, const QJsonArray& body = {}, const QJsonArray& face = {})
@@ -41,11 +38,11 @@ FakeObject person(uint64_t id, uint32_t location, const QJsonArray& body = {}, c
     FakeObject object;
     object.id = id;
     object.location = location;
-    QJsonObject texts{{QStringLiteral("Thumbnail"), QJsonArray{crop(QStringLiteral("body"), body)}}};
+    QJsonObject texts{{u"Thumbnail"_s, QJsonArray{crop(u"body"_s, body)}}};
     if (!face.isEmpty()) {
-        QJsonObject faceCrop = crop(QStringLiteral("face"), face);
-        faceCrop.insert(QStringLiteral("face_detection_info"), QJsonObject{{QStringLiteral("filtered"), 0}});
-        texts.insert(QStringLiteral("FaceThumbnail"), QJsonArray{faceCrop});
+        QJsonObject faceCrop = crop(u"face"_s, face);
+        faceCrop.insert(u"face_detection_info"_s, QJsonObject{{u"filtered"_s, 0}});
+        texts.insert(u"FaceThumbnail"_s, QJsonArray{faceCrop});
     }
     object.thumbnails = thumbnails(texts);
     return object;
@@ -54,7 +51,8 @@ FakeObject person(uint64_t id, uint32_t location, const QJsonArray& body = {}, c
 class WorkerTest : public ::testing::Test
 {
 protected:
-    void SetUp() override
+    void SetUp() override { freshStore(); }
+    void freshStore()
     {
         store = std::make_shared<FakeTamsaWrapper>();
         worker.setTamsa(store);
@@ -69,7 +67,7 @@ protected:
         return store->queries().empty() ? CapturedQuery() : store->queries().back();
     }
 
-    static QVariantMap request(const QStringList& locations = {QStringLiteral("Loc1")})
+    static QVariantMap request(const QStringList& locations = {u"Loc1"_s})
     {
         return {{KEY_LOC_ID_LIST, locations},
                 {KEY_START_TIMESTAMP, qulonglong(1700000000000)},
@@ -116,20 +114,16 @@ TEST_F(WorkerTest, TimeZoneIsStandardBiasInQuarterHoursPlus48)
     EXPECT_EQ(AttributeQueryWorker::makeTZDS(-330, true).wZone, 26); // truncated toward zero
     EXPECT_EQ(AttributeQueryWorker::makeTZDS(0, true).wDaylight, 1);
 
-    {
-        ScopedZone zone("CST-8");
+    // The standard offset counts even while daylight saving time is in force.
+    for (const auto& [name, wZone] : std::vector<std::pair<const char*, int>>{
+             {"CST-8", 16}, {"UTC0", 48}, {"EST5EDT,M3.2.0,M11.1.0", 68}}) {
+        SCOPED_TRACE(name);
+        ScopedZone zone(name);
         const TTAMSA_TZDS tzds = worker.getTamsaTZDS();
-        EXPECT_EQ(tzds.wZone, 16);
-        EXPECT_EQ(tzds.wDaylight, 0);
-    }
-    {
-        ScopedZone zone("UTC0");
-        EXPECT_EQ(worker.getTamsaTZDS().wZone, 48);
-    }
-    {
-        // The standard offset counts even while daylight saving time is in force.
-        ScopedZone zone("EST5EDT,M3.2.0,M11.1.0");
-        EXPECT_EQ(worker.getTamsaTZDS().wZone, 68);
+        EXPECT_EQ(tzds.wZone, wZone);
+        if (wZone == 16) {
+            EXPECT_EQ(tzds.wDaylight, 0); // a zone with no daylight saving time at all
+        }
     }
     {
         ScopedZone zone("UTC0");
@@ -158,17 +152,12 @@ TEST_F(WorkerTest, TimesAreTruncatedToSecondsAndClampedTo32Bits)
 TEST_F(WorkerTest, LocationListsDropEmptyEntriesAndEndWithZero)
 {
     EXPECT_EQ(composed(request({"Loc3", "", "Loc12"})).locations, (std::vector<uint32_t>{3, 12, 0}));
-    store = std::make_shared<FakeTamsaWrapper>();
-    worker.setTamsa(store);
+    freshStore();
     // An unparsable entry becomes 0, which ends the list where the store reads it.
     EXPECT_EQ(composed(request({"Loc3", "X", "Loc5"})).locations, (std::vector<uint32_t>{3, 0}));
-}
 
-TEST_F(WorkerTest, NoUsableLocationOpensNoSearch)
-{
     for (const QStringList& locations : {QStringList{}, QStringList{"", ""}}) {
-        store = std::make_shared<FakeTamsaWrapper>();
-        worker.setTamsa(store);
+        freshStore();
         void* database = nullptr;
         void* search = nullptr;
         EXPECT_EQ(worker.getObjectMetaInfoFirst(request(locations), &database, &search),
@@ -179,90 +168,83 @@ TEST_F(WorkerTest, NoUsableLocationOpensNoSearch)
     }
 }
 
-TEST_F(WorkerTest, AttributeTextsSplitIntoPrimaryAndOther)
+TEST_F(WorkerTest, ObjectTypeAndAttributeTexts)
 {
-    QVariantMap params = request();
-    params.insert(KEY_HUMAN_INFO, QStringLiteral(R"({"Gender":1,"UpperColor":[2]})"));
-    CapturedQuery query = composed(params);
-    EXPECT_EQ(query.objectType, "Human");
-    EXPECT_EQ(parseObject(query.primaryAttributes), (QJsonObject{{"Gender", 1}}));
-    EXPECT_EQ(parseObject(query.otherAttributes), (QJsonObject{{"UpperColor", QJsonArray{2}}}));
-    EXPECT_FALSE(query.plateNumber);
-
-    store = std::make_shared<FakeTamsaWrapper>();
-    worker.setTamsa(store);
-    params = request();
-    params.insert(KEY_VEHICLE_INFO, QStringLiteral(R"({"Type":"car","Color":[1],"PlateNumber":"AB1"})"));
-    query = composed(params);
-    EXPECT_EQ(query.objectType, "Vehicle");
-    EXPECT_EQ(query.primaryAttributes, std::string(R"({"PlateNumber":"AB1","Type":"car"})"));
-    EXPECT_EQ(query.otherAttributes, std::string(R"({"Color":[1]})"));
-
+    using Text = std::optional<std::string>;
+    struct Row
+    {
+        const char* name;
+        QVariantMap extra;
+        Text objectType, primary, other, plate;
+    };
+    const std::vector<Row> rows{
+        {"person attributes split into primary and other",
+         {{KEY_HUMAN_INFO, R"({"Gender":1,"UpperColor":[2]})"}},
+         "Human",
+         R"({"Gender":1})",
+         R"({"UpperColor":[2]})",
+         {}},
+        {"vehicle attributes",
+         {{KEY_VEHICLE_INFO, R"({"Type":"car","Color":[1],"PlateNumber":"AB1"})"}},
+         "Vehicle",
+         R"({"PlateNumber":"AB1","Type":"car"})",
+         R"({"Color":[1]})",
+         {}},
+        // Bad JSON still selects people, with no conditions.
+        {"bad JSON", {{KEY_HUMAN_INFO, "{not json"}}, "Human", "{}", "{}", {}},
+        // A plate makes it a vehicle search, keeping the person texts.
+        {"plate",
+         {{KEY_HUMAN_INFO, R"({"Age":"adult"})"}, {KEY_PLATE_NUMBER, "AB*"}},
+         "Vehicle",
+         R"({"Age":"adult"})",
+         "{}",
+         "AB*"},
+        {"nothing given: any type, no attribute texts", {}, {}, {}, {}, {}},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        freshStore();
+        QVariantMap params = request();
+        params.insert(row.extra);
+        const CapturedQuery query = composed(params);
+        EXPECT_EQ(query.objectType, row.objectType);
+        EXPECT_EQ(query.primaryAttributes, row.primary);
+        EXPECT_EQ(query.otherAttributes, row.other);
+        EXPECT_EQ(query.plateNumber, row.plate);
+    }
     EXPECT_EQ(worker.extractAndRemoveKeyFromJson(QString(), {"Age"}), (QStringList{QString(), QString()}));
-    EXPECT_EQ(worker.extractAndRemoveKeyFromJson(QStringLiteral("{}"), {"Age"}), (QStringList{"{}", "{}"}));
-}
-
-TEST_F(WorkerTest, ObjectTypeSelection)
-{
-    // Bad JSON still selects people, with no conditions.
-    QVariantMap params = request();
-    params.insert(KEY_HUMAN_INFO, QStringLiteral("{not json"));
-    CapturedQuery query = composed(params);
-    EXPECT_EQ(query.objectType, "Human");
-    EXPECT_EQ(query.primaryAttributes, "{}");
-    EXPECT_EQ(query.otherAttributes, "{}");
-
-    // A plate makes it a vehicle search, keeping the person texts.
-    store = std::make_shared<FakeTamsaWrapper>();
-    worker.setTamsa(store);
-    params = request();
-    params.insert(KEY_HUMAN_INFO, QStringLiteral(R"({"Age":"adult"})"));
-    params.insert(KEY_PLATE_NUMBER, QStringLiteral("AB*"));
-    query = composed(params);
-    EXPECT_EQ(query.objectType, "Vehicle");
-    EXPECT_EQ(query.primaryAttributes, std::string(R"({"Age":"adult"})"));
-    EXPECT_EQ(query.plateNumber, "AB*");
-
-    // Nothing given: any type, no attribute texts.
-    store = std::make_shared<FakeTamsaWrapper>();
-    worker.setTamsa(store);
-    query = composed(request());
-    EXPECT_FALSE(query.objectType);
-    EXPECT_FALSE(query.primaryAttributes);
-    EXPECT_FALSE(query.otherAttributes);
+    EXPECT_EQ(worker.extractAndRemoveKeyFromJson(u"{}"_s, {"Age"}), (QStringList{"{}", "{}"}));
 }
 
 TEST_F(WorkerTest, RuleFields)
 {
-    CapturedQuery query = composed(request());
-    EXPECT_FALSE(query.trace);
-    EXPECT_EQ(query.duration, 0u);
-    EXPECT_EQ(query.loitering, 0u);
-    EXPECT_EQ(query.direction, 0);
-
-    const auto withRule = [this](const QString& type) {
-        store = std::make_shared<FakeTamsaWrapper>();
-        worker.setTamsa(store);
-        QVariantMap params = request();
-        params.insert(KEY_RULE_INFO, QVariantMap{{KEY_TYPE, type},
-                                                 {KEY_TRACE, QStringLiteral("[[0,0],[1,1],[1,0]]")},
-                                                 {KEY_DURATION, 30},
-                                                 {KEY_DIRECTION, 2}});
-        return composed(params);
+    struct Row
+    {
+        const char* type; // no rule at all when null
+        std::optional<std::string> trace;
+        uint32_t duration, loitering;
+        int32_t direction;
     };
-    query = withRule(QStringLiteral("intrusion"));
-    EXPECT_EQ(query.trace, "[[0,0],[1,1],[1,0]]");
-    EXPECT_EQ(query.duration, 30u);
-    EXPECT_EQ(query.loitering, 0u);
-    EXPECT_EQ(query.direction, 0);
-
-    query = withRule(QStringLiteral("loitering"));
-    EXPECT_EQ(query.loitering, 1u);
-    EXPECT_EQ(query.direction, 0);
-
-    query = withRule(QStringLiteral("lineCrossing"));
-    EXPECT_EQ(query.loitering, 0u);
-    EXPECT_EQ(query.direction, 2);
+    const char* trace = "[[0,0],[1,1],[1,0]]";
+    for (const Row& row : std::vector<Row>{{nullptr, {}, 0, 0, 0},
+                                           {"intrusion", trace, 30, 0, 0},
+                                           {"loitering", trace, 30, 1, 0},
+                                           {"lineCrossing", trace, 30, 0, 2}}) {
+        SCOPED_TRACE(row.type ? row.type : "no rule");
+        freshStore();
+        QVariantMap params = request();
+        if (row.type) {
+            params.insert(KEY_RULE_INFO, QVariantMap{{KEY_TYPE, row.type},
+                                                     {KEY_TRACE, trace},
+                                                     {KEY_DURATION, 30},
+                                                     {KEY_DIRECTION, 2}});
+        }
+        const CapturedQuery query = composed(params);
+        EXPECT_EQ(query.trace, row.trace);
+        EXPECT_EQ(query.duration, row.duration);
+        EXPECT_EQ(query.loitering, row.loitering);
+        EXPECT_EQ(query.direction, row.direction);
+    }
 }
 
 TEST_F(WorkerTest, FeaturesAndFlags)
@@ -335,15 +317,14 @@ TEST_F(WorkerTest, SearchRecordFromResultRecord)
     object.trajectory = {0.1, 0.2, 0.3, 0.4, 0.5};
     object.trajectoryBytes = 40; // two and a half points: two
     object.attributes = R"({"Gender":1,"UpperColor":[2,3],"Extra":true})";
-    QJsonObject face = crop(QStringLiteral("faceB64"), QJsonArray{1.5});
-    face.insert(QStringLiteral("face_detection_info"), QJsonObject{{QStringLiteral("filtered"), 1}});
-    QJsonObject plate{{QStringLiteral("image"), QStringLiteral("plateB64")},
-                      {QStringLiteral("PlateNumber"), QStringLiteral("AB123")},
-                      {QStringLiteral("detection_info"), QJsonObject{{QStringLiteral("filtered"), 0}}}};
-    object.thumbnails =
-        thumbnails({{QStringLiteral("Thumbnail"), QJsonArray{crop("bodyB64", QJsonArray{0.25, 1})}},
-                    {QStringLiteral("FaceThumbnail"), QJsonArray{face}},
-                    {QStringLiteral("LicensePlateThumbnail"), QJsonArray{plate}}});
+    QJsonObject face = crop(u"faceB64"_s, QJsonArray{1.5});
+    face.insert(u"face_detection_info"_s, QJsonObject{{u"filtered"_s, 1}});
+    QJsonObject plate{{u"image"_s, u"plateB64"_s},
+                      {u"PlateNumber"_s, u"AB123"_s},
+                      {u"detection_info"_s, QJsonObject{{u"filtered"_s, 0}}}};
+    object.thumbnails = thumbnails({{u"Thumbnail"_s, QJsonArray{crop("bodyB64", QJsonArray{0.25, 1})}},
+                                    {u"FaceThumbnail"_s, QJsonArray{face}},
+                                    {u"LicensePlateThumbnail"_s, QJsonArray{plate}}});
     store->objects = {object};
     SearchRecorder recorder;
     worker.query(request({"Loc7"}), recorder.callback());
@@ -457,7 +438,7 @@ TEST_F(WorkerTest, CosineScores)
     // Not numbers: NaN never comes out, and a text counts as 0.
     EXPECT_EQ(score({1, 0}, {std::numeric_limits<double>::quiet_NaN(), 0}), 0.0f);
     EXPECT_EQ(score({std::numeric_limits<float>::infinity(), 1}, {1, 1}), 0.0f);
-    EXPECT_FLOAT_EQ(score({1, 1}, {QStringLiteral("x"), 1}), std::sqrt(0.5f));
+    EXPECT_FLOAT_EQ(score({1, 1}, {u"x"_s, 1}), std::sqrt(0.5f));
 
     QVariantMap record{{KEY_FEATURE, QVariantList{1.0, 0.0}}};
     worker.calculateScore({}, {0.49f, std::sqrt(1 - 0.49f * 0.49f)}, record);

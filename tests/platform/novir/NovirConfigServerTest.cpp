@@ -12,12 +12,14 @@
 #include <functional>
 #include <gtest/gtest.h>
 
+using namespace Qt::StringLiterals;
+
 namespace {
 
 using NSNovirTunnelClient::ConfigServer;
 using NSNovirTunnelClient::LocationServer;
 
-const QString kPlugin = QStringLiteral("test-plugin");
+const QString kPlugin = u"test-plugin"_s;
 
 // Everything the server called, from whichever thread.
 struct Recorder
@@ -58,7 +60,7 @@ struct Recorder
         info.strContent = content;
         info.respCB = [this](bool success, const QString& cmd, const QString&, const QString& rc,
                              const QString& text, bool finish) {
-            add(Call{QStringLiteral("part:") + cmd, success, rc, text, finish, {}, nullptr});
+            add(Call{u"part:"_s + cmd, success, rc, text, finish, {}, nullptr});
         };
         return info;
     }
@@ -110,12 +112,11 @@ protected:
         server->registerConnectStatusHandler(
             kPlugin, NSNovirTunnelClient::ConnectStatus,
             [this](Qt::HANDLE, NSNovirTunnelClient::ServerType type, bool up) {
-                recorder.add(Recorder::Call{
-                    QStringLiteral("connect:%1").arg(int(type)), up, {}, {}, false, {}, nullptr});
+                recorder.add(Recorder::Call{u"connect:%1"_s.arg(int(type)), up, {}, {}, false, {}, nullptr});
             },
             QString());
         server->start();
-        ASSERT_TRUE(waitFor([&] { return recorder.matching(QStringLiteral("connect:4")).size() == 1; }));
+        ASSERT_TRUE(waitFor([&] { return recorder.matching(u"connect:4"_s).size() == 1; }));
     }
     void listen(const QString& name)
     {
@@ -123,34 +124,32 @@ protected:
             kPlugin, server->getServerAccountID(), ConfigServer, name,
             [this](Qt::HANDLE, const QString& broadcastName, NSNovirTunnelClient::ServerType, const QString&,
                    const QString& message) {
-                recorder.add(Recorder::Call{
-                    QStringLiteral("broadcast:") + broadcastName, true, {}, message, false, {}, nullptr});
+                recorder.add(
+                    Recorder::Call{u"broadcast:"_s + broadcastName, true, {}, message, false, {}, nullptr});
             },
             QString());
     }
     bool subscribe(const QString& serverId)
     {
         return server->insertSubscribeRequest(
-            kPlugin, server->getServerAccountID(), ConfigServer, QStringLiteral("SubCamStatus"),
-            recorder.request(QStringLiteral("<SubCamStatus><SID>%1</SID></SubCamStatus>").arg(serverId)),
-            serverId,
+            kPlugin, server->getServerAccountID(), ConfigServer, u"SubCamStatus"_s,
+            recorder.request(u"<SubCamStatus><SID>%1</SID></SubCamStatus>"_s.arg(serverId)), serverId,
             [this](Qt::HANDLE, const QString& sourceId, const QString&, NSNovirTunnelClient::ServerType,
                    const QString&, const QString& message) {
-                recorder.add(
-                    Recorder::Call{QStringLiteral("event"), true, {}, message, false, sourceId, nullptr});
+                recorder.add(Recorder::Call{u"event"_s, true, {}, message, false, sourceId, nullptr});
             });
     }
     QList<Recorder::Call> ask(const QString& cmd, const QString& content,
                               NSNovirTunnelClient::ServerType type)
     {
-        const int before = recorder.matching(QStringLiteral("part:") + cmd).size();
+        const int before = recorder.matching(u"part:"_s + cmd).size();
         EXPECT_TRUE(server->insertRequest(kPlugin, server->getServerAccountID(), type, cmd,
                                           recorder.request(content)));
         EXPECT_TRUE(waitFor([&] {
-            const auto parts = recorder.matching(QStringLiteral("part:") + cmd);
+            const auto parts = recorder.matching(u"part:"_s + cmd);
             return parts.size() > before && parts.last().finish;
         }));
-        return recorder.matching(QStringLiteral("part:") + cmd).mid(before);
+        return recorder.matching(u"part:"_s + cmd).mid(before);
     }
 
     NovirSite site;
@@ -167,7 +166,7 @@ TEST(NovirSite, DefaultSiteAndSiteFiles)
     int protectedCount = 0;
     int multiChannel = 0;
     for (const NovirCamera& camera : site.cameras) {
-        EXPECT_EQ(camera.ip, QStringLiteral("127.0.0.1"));
+        EXPECT_EQ(camera.ip, u"127.0.0.1"_s);
         protectedCount += camera.protectCap ? 1 : 0;
         multiChannel += camera.channelCount > 1 ? 1 : 0;
     }
@@ -175,7 +174,7 @@ TEST(NovirSite, DefaultSiteAndSiteFiles)
     EXPECT_EQ(multiChannel, 2); // one camera, two channel entries
 
     QTemporaryDir dir;
-    const QString path = dir.filePath(QStringLiteral("site.json"));
+    const QString path = dir.filePath(u"site.json"_s);
     QFile file(path);
     ASSERT_TRUE(file.open(QIODevice::WriteOnly));
     file.write(
@@ -186,7 +185,7 @@ TEST(NovirSite, DefaultSiteAndSiteFiles)
     NovirSite loaded;
     QString error;
     ASSERT_TRUE(NovirSite::fromFile(path, &loaded, &error)) << qPrintable(error);
-    EXPECT_EQ(loaded.serverId, QStringLiteral("s9"));
+    EXPECT_EQ(loaded.serverId, u"s9"_s);
     EXPECT_EQ(loaded.partSize, 2);
     ASSERT_EQ(loaded.cameras.size(), 1);
     const NovirCamera& a = loaded.cameras.first();
@@ -194,7 +193,7 @@ TEST(NovirSite, DefaultSiteAndSiteFiles)
     EXPECT_TRUE(a.useSsl);
     EXPECT_EQ(a.httpsPort, 4443);
     EXPECT_EQ(a.channelCount, 3);
-    EXPECT_EQ(a.location, QStringLiteral("Loc5"));
+    EXPECT_EQ(a.location, u"Loc5"_s);
     EXPECT_FALSE(a.live);
     EXPECT_FALSE(a.online);
 
@@ -211,23 +210,23 @@ TEST(NovirSite, DefaultSiteAndSiteFiles)
                                    R"({"cameras":[{"name":"A","port":80.5}]})"};
     for (const QByteArray& json : bad) {
         NovirSite untouched;
-        untouched.serverId = QStringLiteral("keep");
+        untouched.serverId = u"keep"_s;
         EXPECT_FALSE(NovirSite::fromJson(json, &untouched, &error)) << json.constData();
         EXPECT_FALSE(error.isEmpty());
-        EXPECT_EQ(untouched.serverId, QStringLiteral("keep"));
+        EXPECT_EQ(untouched.serverId, u"keep"_s);
     }
-    EXPECT_FALSE(NovirSite::fromFile(dir.filePath(QStringLiteral("missing.json")), &loaded, &error));
+    EXPECT_FALSE(NovirSite::fromFile(dir.filePath(u"missing.json"_s), &loaded, &error));
 }
 
 TEST(NovirSite, TextsAreEscaped)
 {
     NovirCamera camera;
-    camera.name = QStringLiteral("A<&>B");
-    camera.password = QStringLiteral("p");
-    camera.location = QStringLiteral("Loc1");
+    camera.name = u"A<&>B"_s;
+    camera.password = u"p"_s;
+    camera.location = u"Loc1"_s;
     const QString xml = NovirSite::nodeInfoXml({camera});
     EXPECT_EQ(namesIn(xml, "NodeInfo", "Cameras", "Cam", "Name"), QStringList{camera.name});
-    EXPECT_TRUE(xml.contains(QStringLiteral("<Pwd>70</Pwd>")));
+    EXPECT_TRUE(xml.contains(u"<Pwd>70</Pwd>"_s));
     EXPECT_EQ(namesIn(NovirSite::locationsXml({camera}), "LocRecs", "LocList", "Loc", "Alias"),
               QStringList{camera.name});
 }
@@ -235,8 +234,7 @@ TEST(NovirSite, TextsAreEscaped)
 TEST_F(ServerTest, CallbacksComeFromTheServerThreadAfterConnection)
 {
     startServer();
-    const auto connects =
-        recorder.matching(QStringLiteral("connect:1")) + recorder.matching(QStringLiteral("connect:4"));
+    const auto connects = recorder.matching(u"connect:1"_s) + recorder.matching(u"connect:4"_s);
     ASSERT_EQ(connects.size(), 2);
     for (const auto& call : connects) {
         EXPECT_TRUE(call.success);
@@ -257,23 +255,22 @@ TEST_F(ServerTest, CallbacksComeFromTheServerThreadAfterConnection)
     EXPECT_TRUE(waitFor([&] { return late == 1; }));
 
     server->setServerConnected(LocationServer, false);
-    EXPECT_TRUE(waitFor([&] { return recorder.matching(QStringLiteral("connect:4")).size() == 2; }));
-    EXPECT_FALSE(recorder.matching(QStringLiteral("connect:4")).last().success);
-    EXPECT_FALSE(server->insertRequest(kPlugin, nullptr, LocationServer, QStringLiteral("QryLocs"),
-                                       recorder.request(QStringLiteral("<QryLocs/>"))));
+    EXPECT_TRUE(waitFor([&] { return recorder.matching(u"connect:4"_s).size() == 2; }));
+    EXPECT_FALSE(recorder.matching(u"connect:4"_s).last().success);
+    EXPECT_FALSE(server->insertRequest(kPlugin, nullptr, LocationServer, u"QryLocs"_s,
+                                       recorder.request(u"<QryLocs/>"_s)));
 }
 
 TEST_F(ServerTest, NodeInfoAndLocationsComeInParts)
 {
     startServer();
     const auto parts =
-        ask(QStringLiteral("GetNodeInfo"),
-            QStringLiteral("<GetNodeInfo><Node>__allcams__</Node></GetNodeInfo>"), ConfigServer);
+        ask(u"GetNodeInfo"_s, u"<GetNodeInfo><Node>__allcams__</Node></GetNodeInfo>"_s, ConfigServer);
     ASSERT_EQ(parts.size(), 3); // 8 cameras, 3 per part
     QStringList names;
     for (int i = 0; i < parts.size(); ++i) {
         EXPECT_TRUE(parts.at(i).success);
-        EXPECT_EQ(parts.at(i).retCode, QStringLiteral("0"));
+        EXPECT_EQ(parts.at(i).retCode, u"0"_s);
         EXPECT_EQ(parts.at(i).finish, i == parts.size() - 1);
         EXPECT_NE(parts.at(i).thread, QThread::currentThread());
         names += namesIn(parts.at(i).text, "NodeInfo", "Cameras", "Cam", "Name");
@@ -286,61 +283,51 @@ TEST_F(ServerTest, NodeInfoAndLocationsComeInParts)
     expected.sort();
     EXPECT_EQ(names, expected);
 
-    const auto one = ask(QStringLiteral("GetNodeInfo"),
-                         QStringLiteral("<GetNodeInfo><Node>Lobby</Node></GetNodeInfo>"), ConfigServer);
+    const auto one = ask(u"GetNodeInfo"_s, u"<GetNodeInfo><Node>Lobby</Node></GetNodeInfo>"_s, ConfigServer);
     ASSERT_EQ(one.size(), 1);
-    EXPECT_EQ(namesIn(one.first().text, "NodeInfo", "Cameras", "Cam", "Name"),
-              QStringList{QStringLiteral("Lobby")});
-    const auto none = ask(QStringLiteral("GetNodeInfo"),
-                          QStringLiteral("<GetNodeInfo><Node>Nobody</Node></GetNodeInfo>"), ConfigServer);
+    EXPECT_EQ(namesIn(one.first().text, "NodeInfo", "Cameras", "Cam", "Name"), QStringList{u"Lobby"_s});
+    const auto none =
+        ask(u"GetNodeInfo"_s, u"<GetNodeInfo><Node>Nobody</Node></GetNodeInfo>"_s, ConfigServer);
     EXPECT_TRUE(namesIn(none.first().text, "NodeInfo", "Cameras", "Cam", "Name").isEmpty());
 
     const auto locations =
-        ask(QStringLiteral("QryLocs"), QStringLiteral("<QryLocs><LiveOnly>false</LiveOnly></QryLocs>"),
-            LocationServer);
+        ask(u"QryLocs"_s, u"<QryLocs><LiveOnly>false</LiveOnly></QryLocs>"_s, LocationServer);
     QStringList aliases;
     for (const auto& part : locations) {
         Quellon quellon;
-        for (const QVariant& list : Quellon::transContentAsList(quellon.parse(part.text)
-                                                                    .toMap()
-                                                                    .value(QStringLiteral("LocRecs"))
-                                                                    .toMap()
-                                                                    .value(QStringLiteral("LocList")))) {
-            for (const QVariant& loc :
-                 Quellon::transContentAsList(list.toMap().value(QStringLiteral("Loc")))) {
-                aliases << loc.toMap().value(QStringLiteral("Alias")).toString();
+        for (const QVariant& list : Quellon::transContentAsList(
+                 quellon.parse(part.text).toMap().value(u"LocRecs"_s).toMap().value(u"LocList"_s))) {
+            for (const QVariant& loc : Quellon::transContentAsList(list.toMap().value(u"Loc"_s))) {
+                aliases << loc.toMap().value(u"Alias"_s).toString();
             }
         }
     }
     aliases.sort();
-    EXPECT_EQ(aliases,
-              (QStringList{QStringLiteral("Entrance"), QStringLiteral("Loading"), QStringLiteral("Lobby"),
-                           QStringLiteral("ParkingGate"), QStringLiteral("Storage"),
-                           QStringLiteral("Warehouse-1"), QStringLiteral("Warehouse-2")}));
+    EXPECT_EQ(aliases, (QStringList{u"Entrance"_s, u"Loading"_s, u"Lobby"_s, u"ParkingGate"_s, u"Storage"_s,
+                                    u"Warehouse-1"_s, u"Warehouse-2"_s}));
     EXPECT_EQ(locations.size(), 3);
 
-    const auto unknown = ask(QStringLiteral("NoSuchCommand"), QString(), ConfigServer);
+    const auto unknown = ask(u"NoSuchCommand"_s, QString(), ConfigServer);
     EXPECT_FALSE(unknown.first().success);
-    EXPECT_EQ(unknown.first().retCode, QStringLiteral("-1"));
-    EXPECT_GE(server->answeredCount(QStringLiteral("GetNodeInfo")), 3);
+    EXPECT_EQ(unknown.first().retCode, u"-1"_s);
+    EXPECT_GE(server->answeredCount(u"GetNodeInfo"_s), 3);
 }
 
 TEST_F(ServerTest, SubscriptionGetsCurrentStatesThenChanges)
 {
     startServer();
-    EXPECT_FALSE(subscribe(QStringLiteral("another-server")));
+    EXPECT_FALSE(subscribe(u"another-server"_s));
     ASSERT_TRUE(subscribe(site.serverId));
-    ASSERT_TRUE(waitFor([&] { return recorder.matching(QStringLiteral("event")).size() == 1; }));
-    const auto first = recorder.matching(QStringLiteral("event")).first();
+    ASSERT_TRUE(waitFor([&] { return recorder.matching(u"event"_s).size() == 1; }));
+    const auto first = recorder.matching(u"event"_s).first();
     EXPECT_EQ(first.sourceId, site.serverId);
-    EXPECT_TRUE(
-        first.text.contains(QStringLiteral("<Name>Loading</Name><ConnState>Disconnected</ConnState>")));
-    EXPECT_TRUE(first.text.contains(QStringLiteral("<Name>Lobby</Name><ConnState>Connected</ConnState>")));
-    EXPECT_EQ(recorder.matching(QStringLiteral("part:SubCamStatus")).size(), 1);
+    EXPECT_TRUE(first.text.contains(u"<Name>Loading</Name><ConnState>Disconnected</ConnState>"_s));
+    EXPECT_TRUE(first.text.contains(u"<Name>Lobby</Name><ConnState>Connected</ConnState>"_s));
+    EXPECT_EQ(recorder.matching(u"part:SubCamStatus"_s).size(), 1);
 
-    server->setCameraOnline(QStringLiteral("Lobby"), false);
-    ASSERT_TRUE(waitFor([&] { return recorder.matching(QStringLiteral("event")).size() == 2; }));
-    EXPECT_EQ(recorder.matching(QStringLiteral("event")).last().text,
+    server->setCameraOnline(u"Lobby"_s, false);
+    ASSERT_TRUE(waitFor([&] { return recorder.matching(u"event"_s).size() == 2; }));
+    EXPECT_EQ(recorder.matching(u"event"_s).last().text,
               QStringLiteral(
                   "<CamStatus><Cam><Name>Lobby</Name><ConnState>Disconnected</ConnState></Cam></CamStatus>"));
 }
@@ -352,31 +339,32 @@ TEST_F(ServerTest, SiteChangesAreBroadcast)
         listen(QLatin1String(name));
     }
     NovirCamera camera;
-    camera.name = QStringLiteral("Dock");
-    camera.location = QStringLiteral("Loc20");
+    camera.name = u"Dock"_s;
+    camera.location = u"Loc20"_s;
     camera.groupId = 3;
     server->addCamera(camera);
     server->changeCamera(camera);
-    server->removeChannel(QStringLiteral("Dock"));
-    server->addChannel(QStringLiteral("Dock"), QStringLiteral("Loc21"), 4);
-    server->removeCamera(QStringLiteral("Dock"));
-    server->removeCamera(QStringLiteral("Dock")); // already gone: nothing
-    ASSERT_TRUE(waitFor([&] { return recorder.matching(QStringLiteral("broadcast:CamRmv")).size() == 1; }));
+    server->removeChannel(u"Dock"_s);
+    server->addChannel(u"Dock"_s, u"Loc21"_s, 4);
+    server->removeCamera(u"Dock"_s);
+    server->removeCamera(u"Dock"_s); // already gone: nothing
+    ASSERT_TRUE(waitFor([&] { return recorder.matching(u"broadcast:CamRmv"_s).size() == 1; }));
     server->flush();
-    EXPECT_EQ(recorder.matching(QStringLiteral("broadcast:CamIns")).first().text,
-              QStringLiteral("<CamIns><Entry><Name>Dock</Name></Entry></CamIns>"));
-    const auto channelAdds = recorder.matching(QStringLiteral("broadcast:ChannelAdd"));
-    ASSERT_EQ(channelAdds.size(), 2);
-    EXPECT_EQ(
-        channelAdds.last().text,
-        QStringLiteral("<ChannelAdd><CamName>Dock</CamName><Loc>Loc21</Loc><GrpID>4</GrpID></ChannelAdd>"));
-    EXPECT_EQ(recorder.matching(QStringLiteral("broadcast:CamInfoChange")).first().text,
-              QStringLiteral("<CamInfoChange><Cam>Dock</Cam></CamInfoChange>"));
-    EXPECT_EQ(recorder.matching(QStringLiteral("broadcast:ChannelRmv")).first().text,
-              QStringLiteral("<ChannelRmv><CamName>Dock</CamName></ChannelRmv>"));
-    EXPECT_EQ(recorder.matching(QStringLiteral("broadcast:CamRmv")).size(), 1);
-    EXPECT_EQ(recorder.matching(QStringLiteral("broadcast:CamRmv")).first().text,
-              QStringLiteral("<CamRm><Name>Dock</Name></CamRm>"));
+    const std::vector<std::pair<const char*, QString>> expected{
+        {"CamIns", u"<CamIns><Entry><Name>Dock</Name></Entry></CamIns>"_s},
+        {"ChannelAdd", u"<ChannelAdd><CamName>Dock</CamName><Loc>Loc21</Loc><GrpID>4</GrpID></ChannelAdd>"_s},
+        {"CamInfoChange", u"<CamInfoChange><Cam>Dock</Cam></CamInfoChange>"_s},
+        {"ChannelRmv", u"<ChannelRmv><CamName>Dock</CamName></ChannelRmv>"_s},
+        {"CamRmv", u"<CamRm><Name>Dock</Name></CamRm>"_s}};
+    for (const auto& [name, text] : expected) {
+        SCOPED_TRACE(name);
+        const auto calls = recorder.matching(u"broadcast:"_s + QLatin1String(name));
+        const bool channelAdd = QLatin1String(name) == QLatin1String("ChannelAdd");
+        ASSERT_EQ(calls.isEmpty(), false);
+        EXPECT_EQ((channelAdd ? calls.last() : calls.first()).text, text);
+    }
+    EXPECT_EQ(recorder.matching(u"broadcast:ChannelAdd"_s).size(), 2);
+    EXPECT_EQ(recorder.matching(u"broadcast:CamRmv"_s).size(), 1);
 }
 
 TEST_F(ServerTest, InputObjectMetaInfoIsStored)
@@ -392,19 +380,18 @@ TEST_F(ServerTest, InputObjectMetaInfoIsStored)
         "]}");
     // Without a store the ingest fails.
     const auto refused =
-        ask(QStringLiteral("InputObjectMetaInfo"), message.arg(object.arg(1), object.arg(2)), ConfigServer);
+        ask(u"InputObjectMetaInfo"_s, message.arg(object.arg(1), object.arg(2)), ConfigServer);
     EXPECT_FALSE(refused.first().success);
 
     server.reset();
     recorder.calls.clear();
-    startServer(dir.filePath(QStringLiteral("Server")));
+    startServer(dir.filePath(u"Server"_s));
     const auto stored =
-        ask(QStringLiteral("InputObjectMetaInfo"), message.arg(object.arg(1), object.arg(2)), ConfigServer);
+        ask(u"InputObjectMetaInfo"_s, message.arg(object.arg(1), object.arg(2)), ConfigServer);
     ASSERT_EQ(stored.size(), 1);
     EXPECT_TRUE(stored.first().success) << qPrintable(stored.first().text);
     EXPECT_EQ(server->ingestedObjects(), 2);
-    const auto malformed = ask(QStringLiteral("InputObjectMetaInfo"),
-                               QStringLiteral("<InputObjectMetaInfo><GroupID>x"), ConfigServer);
+    const auto malformed = ask(u"InputObjectMetaInfo"_s, u"<InputObjectMetaInfo><GroupID>x"_s, ConfigServer);
     EXPECT_FALSE(malformed.first().success);
     EXPECT_EQ(server->ingestedObjects(), 2);
 }

@@ -13,6 +13,8 @@
 #include <memory>
 #include <vector>
 
+using namespace Qt::StringLiterals;
+
 namespace {
 
 class FakeTools final : public IFrameworkTools
@@ -31,20 +33,14 @@ private:
 
 QVariantMap camera(const QString& name, int port = 80)
 {
-    return QVariantMap{{QStringLiteral("Name"), name},
-                       {QStringLiteral("IP"), QStringLiteral("127.0.0.1")},
-                       {QStringLiteral("Port"), port},
-                       {QStringLiteral("UseSSL"), false},
-                       {QStringLiteral("User"), QStringLiteral("u")},
-                       {QStringLiteral("Password"), QStringLiteral("70")},
-                       {QStringLiteral("DelvixProtect"), false}};
+    return QVariantMap{{u"Name"_s, name},          {u"IP"_s, u"127.0.0.1"_s}, {u"Port"_s, port},
+                       {u"UseSSL"_s, false},       {u"User"_s, u"u"_s},       {u"Password"_s, u"70"_s},
+                       {u"DelvixProtect"_s, false}};
 }
 
 QVariantMap location(const QString& loc, int group = 1, bool recording = true)
 {
-    return QVariantMap{{QStringLiteral("Location"), loc},
-                       {QStringLiteral("GroupID"), group},
-                       {QStringLiteral("IsRecording"), recording}};
+    return QVariantMap{{u"Location"_s, loc}, {u"GroupID"_s, group}, {u"IsRecording"_s, recording}};
 }
 
 class CollectorTest : public ::testing::Test
@@ -57,14 +53,13 @@ protected:
         // One log of everything announced, in order.
         QObject::connect(collector.get(), &ICameraInformationCollector::cameraInformationChanged,
                          collector.get(), [this](const QVariantMap& map) {
-                             events << QStringLiteral("changed");
+                             events << u"changed"_s;
                              directory = map;
                          });
         QObject::connect(collector.get(), &ICameraInformationCollector::cameraDisconnected, collector.get(),
-                         [this](const QString& name) { events << QStringLiteral("disconnected:") + name; });
-        QObject::connect(
-            collector.get(), &ICameraInformationCollector::locationRemoved, collector.get(),
-            [this](const QString& name) { events << QStringLiteral("locationRemoved:") + name; });
+                         [this](const QString& name) { events << u"disconnected:"_s + name; });
+        QObject::connect(collector.get(), &ICameraInformationCollector::locationRemoved, collector.get(),
+                         [this](const QString& name) { events << u"locationRemoved:"_s + name; });
     }
 
     // A camera with its record, location and status true.
@@ -77,13 +72,13 @@ protected:
     // The request writeData sent, or null.
     const ScriptedTunnelClient::Request* sentMetaInfo() const
     {
-        const int index = client.lastRequest(QStringLiteral("InputObjectMetaInfo"));
+        const int index = client.lastRequest(u"InputObjectMetaInfo"_s);
         return index < 0 ? nullptr : &client.requests.at(index);
     }
     QString infoOf(const QString& content) const
     {
-        const qsizetype start = content.indexOf(QStringLiteral("<Info>")) + 6;
-        return content.mid(start, content.lastIndexOf(QStringLiteral("</Info>")) - start);
+        const qsizetype start = content.indexOf(u"<Info>"_s) + 6;
+        return content.mid(start, content.lastIndexOf(u"</Info>"_s) - start);
     }
 
     ScriptedTunnelClient client;
@@ -98,110 +93,108 @@ protected:
 
 TEST_F(CollectorTest, CameraIsAnnouncedOnlyWithRecordLocationAndOnlineStatus)
 {
-    emit control->updateCameras(QVariantMap{{QStringLiteral("A"), camera(QStringLiteral("A"))}});
-    emit control->updateLocations(QVariantMap{{QStringLiteral("A"), location(QStringLiteral("Loc1"))}});
+    emit control->updateCameras(QVariantMap{{u"A"_s, camera(u"A"_s)}});
+    emit control->updateLocations(QVariantMap{{u"A"_s, location(u"Loc1"_s)}});
     EXPECT_TRUE(directory.isEmpty()); // no status event yet
-    EXPECT_EQ(events, (QStringList{QStringLiteral("changed"), QStringLiteral("changed")}));
+    EXPECT_EQ(events, (QStringList{u"changed"_s, u"changed"_s}));
 
-    emit control->updateCameraStatus(QStringLiteral("A"), true);
-    ASSERT_EQ(directory.keys(), QStringList{QStringLiteral("A")});
-    const QVariantMap record = directory.value(QStringLiteral("A")).toMap();
-    EXPECT_EQ(record.value(QStringLiteral("Port")).toInt(), 80);
-    EXPECT_EQ(record.value(QStringLiteral("Location")).toString(), QStringLiteral("Loc1"));
-    EXPECT_EQ(record.value(QStringLiteral("GroupID")).toInt(), 1);
+    emit control->updateCameraStatus(u"A"_s, true);
+    ASSERT_EQ(directory.keys(), QStringList{u"A"_s});
+    const QVariantMap record = directory.value(u"A"_s).toMap();
+    EXPECT_EQ(record.value(u"Port"_s).toInt(), 80);
+    EXPECT_EQ(record.value(u"Location"_s).toString(), u"Loc1"_s);
+    EXPECT_EQ(record.value(u"GroupID"_s).toInt(), 1);
     EXPECT_EQ(collector->cameraDirectory(), directory);
 
     events.clear();
-    emit control->updateCameraStatus(QStringLiteral("A"), false);
-    EXPECT_EQ(events, (QStringList{QStringLiteral("disconnected:A"), QStringLiteral("changed")}));
+    emit control->updateCameraStatus(u"A"_s, false);
+    EXPECT_EQ(events, (QStringList{u"disconnected:A"_s, u"changed"_s}));
     EXPECT_TRUE(directory.isEmpty());
 
     // Unknown names change nothing but are still announced.
     events.clear();
-    emit control->removeCamera(QStringLiteral("nobody"));
-    EXPECT_EQ(events, QStringList{QStringLiteral("changed")});
+    emit control->removeCamera(u"nobody"_s);
+    EXPECT_EQ(events, QStringList{u"changed"_s});
 }
 
 TEST_F(CollectorTest, UpdatesOfOfflineOrRemovedCameras)
 {
-    emit control->addLocation(QStringLiteral("A"), location(QStringLiteral("Loc1")));
-    emit control->updateCameraStatus(QStringLiteral("A"), false);
-    emit control->updateCamera(QStringLiteral("A"), camera(QStringLiteral("A"), 81));
+    emit control->addLocation(u"A"_s, location(u"Loc1"_s));
+    emit control->updateCameraStatus(u"A"_s, false);
+    emit control->updateCamera(u"A"_s, camera(u"A"_s, 81));
     EXPECT_TRUE(directory.isEmpty()); // stored, not announced
-    emit control->updateCameraStatus(QStringLiteral("A"), true);
-    EXPECT_EQ(directory.value(QStringLiteral("A")).toMap().value(QStringLiteral("Port")).toInt(), 81);
+    emit control->updateCameraStatus(u"A"_s, true);
+    EXPECT_EQ(directory.value(u"A"_s).toMap().value(u"Port"_s).toInt(), 81);
 
     // Removing the camera keeps its status and location: the next record announces it at once.
-    emit control->removeCamera(QStringLiteral("A"));
+    emit control->removeCamera(u"A"_s);
     EXPECT_TRUE(directory.isEmpty());
-    emit control->updateCamera(QStringLiteral("A"), camera(QStringLiteral("A"), 82));
-    EXPECT_EQ(directory.value(QStringLiteral("A")).toMap().value(QStringLiteral("Port")).toInt(), 82);
+    emit control->updateCamera(u"A"_s, camera(u"A"_s, 82));
+    EXPECT_EQ(directory.value(u"A"_s).toMap().value(u"Port"_s).toInt(), 82);
 
     // A new camera list replaces the old one and rebuilds the directory.
-    bringOnline(QStringLiteral("B"), QStringLiteral("Loc2"));
-    EXPECT_EQ(directory.keys(), (QStringList{QStringLiteral("A"), QStringLiteral("B")}));
-    emit control->updateCameras(QVariantMap{{QStringLiteral("B"), camera(QStringLiteral("B"))}});
-    EXPECT_EQ(directory.keys(), QStringList{QStringLiteral("B")});
+    bringOnline(u"B"_s, u"Loc2"_s);
+    EXPECT_EQ(directory.keys(), (QStringList{u"A"_s, u"B"_s}));
+    emit control->updateCameras(QVariantMap{{u"B"_s, camera(u"B"_s)}});
+    EXPECT_EQ(directory.keys(), QStringList{u"B"_s});
 }
 
 TEST_F(CollectorTest, RemovedLocationStaysWithRecordingOff)
 {
-    bringOnline(QStringLiteral("A"), QStringLiteral("Loc1"));
+    bringOnline(u"A"_s, u"Loc1"_s);
     events.clear();
-    emit control->removeLocation(QStringLiteral("A"));
-    EXPECT_EQ(events, (QStringList{QStringLiteral("locationRemoved:A"), QStringLiteral("changed")}));
+    emit control->removeLocation(u"A"_s);
+    EXPECT_EQ(events, (QStringList{u"locationRemoved:A"_s, u"changed"_s}));
     EXPECT_TRUE(directory.isEmpty());
     // A later merge brings it back, not recording.
-    emit control->updateCameraStatus(QStringLiteral("A"), true);
-    const QVariantMap back = directory.value(QStringLiteral("A")).toMap();
-    EXPECT_EQ(back.value(QStringLiteral("Location")).toString(), QStringLiteral("Loc1"));
-    EXPECT_EQ(back.value(QStringLiteral("IsRecording")), QVariant(false));
+    emit control->updateCameraStatus(u"A"_s, true);
+    const QVariantMap back = directory.value(u"A"_s).toMap();
+    EXPECT_EQ(back.value(u"Location"_s).toString(), u"Loc1"_s);
+    EXPECT_EQ(back.value(u"IsRecording"_s), QVariant(false));
 
     // Without a location record, removal creates one that holds only the recording flag.
-    emit control->updateCamera(QStringLiteral("B"), camera(QStringLiteral("B")));
-    emit control->removeLocation(QStringLiteral("B"));
-    emit control->updateCameraStatus(QStringLiteral("B"), true);
-    const QVariantMap b = directory.value(QStringLiteral("B")).toMap();
-    EXPECT_EQ(b.value(QStringLiteral("IsRecording")), QVariant(false));
-    EXPECT_FALSE(b.contains(QStringLiteral("Location")));
+    emit control->updateCamera(u"B"_s, camera(u"B"_s));
+    emit control->removeLocation(u"B"_s);
+    emit control->updateCameraStatus(u"B"_s, true);
+    const QVariantMap b = directory.value(u"B"_s).toMap();
+    EXPECT_EQ(b.value(u"IsRecording"_s), QVariant(false));
+    EXPECT_FALSE(b.contains(u"Location"_s));
 }
 
 TEST_F(CollectorTest, LocationValueWinsOverCameraValue)
 {
-    QVariantMap record = camera(QStringLiteral("A"));
-    record.insert(QStringLiteral("GroupID"), 9);
-    record.insert(QStringLiteral("Location"), QStringLiteral("LocX"));
-    emit control->updateCamera(QStringLiteral("A"), record);
-    emit control->addLocation(QStringLiteral("A"), location(QStringLiteral("Loc4"), 2));
-    emit control->updateCameraStatus(QStringLiteral("A"), true);
-    const QVariantMap merged = directory.value(QStringLiteral("A")).toMap();
-    EXPECT_EQ(merged.value(QStringLiteral("GroupID")).toInt(), 2);
-    EXPECT_EQ(merged.value(QStringLiteral("Location")).toString(), QStringLiteral("Loc4"));
-    EXPECT_EQ(merged.value(QStringLiteral("Name")).toString(), QStringLiteral("A"));
+    QVariantMap record = camera(u"A"_s);
+    record.insert(u"GroupID"_s, 9);
+    record.insert(u"Location"_s, u"LocX"_s);
+    emit control->updateCamera(u"A"_s, record);
+    emit control->addLocation(u"A"_s, location(u"Loc4"_s, 2));
+    emit control->updateCameraStatus(u"A"_s, true);
+    const QVariantMap merged = directory.value(u"A"_s).toMap();
+    EXPECT_EQ(merged.value(u"GroupID"_s).toInt(), 2);
+    EXPECT_EQ(merged.value(u"Location"_s).toString(), u"Loc4"_s);
+    EXPECT_EQ(merged.value(u"Name"_s).toString(), u"A"_s);
 }
 
 TEST_F(CollectorTest, LocationToCameraFollowsEveryLocationChange)
 {
-    EXPECT_TRUE(collector->getCameraNodeID(QStringLiteral("Loc1")).isEmpty());
-    emit control->updateLocations(QVariantMap{{QStringLiteral("Zed"), location(QStringLiteral("Loc1"))},
-                                              {QStringLiteral("Alpha"), location(QStringLiteral("Loc1"))},
-                                              {QStringLiteral("Mid"), location(QStringLiteral("Loc2"))}});
-    EXPECT_EQ(collector->getCameraNodeID(QStringLiteral("Loc1")), QStringLiteral("Alpha")); // first by name
-    EXPECT_EQ(collector->getCameraNodeID(QStringLiteral("Loc2")), QStringLiteral("Mid"));
-    EXPECT_TRUE(collector->getCameraNodeID(QStringLiteral("Loc9")).isEmpty());
-    EXPECT_TRUE(collector->getCameraNodeID(QStringLiteral("loc2")).isEmpty()); // exact match only
-    emit control->addLocation(QStringLiteral("New"), location(QStringLiteral("Loc9")));
-    EXPECT_EQ(collector->getCameraNodeID(QStringLiteral("Loc9")), QStringLiteral("New"));
-    emit control->updateLocations(QVariantMap{{QStringLiteral("Mid"), location(QStringLiteral("Loc1"))}});
-    EXPECT_EQ(collector->getCameraNodeID(QStringLiteral("Loc1")), QStringLiteral("Mid"));
-    EXPECT_TRUE(collector->getCameraNodeID(QStringLiteral("Loc9")).isEmpty());
+    EXPECT_TRUE(collector->getCameraNodeID(u"Loc1"_s).isEmpty());
+    emit control->updateLocations(QVariantMap{
+        {u"Zed"_s, location(u"Loc1"_s)}, {u"Alpha"_s, location(u"Loc1"_s)}, {u"Mid"_s, location(u"Loc2"_s)}});
+    EXPECT_EQ(collector->getCameraNodeID(u"Loc1"_s), u"Alpha"_s); // first by name
+    EXPECT_EQ(collector->getCameraNodeID(u"Loc2"_s), u"Mid"_s);
+    EXPECT_TRUE(collector->getCameraNodeID(u"Loc9"_s).isEmpty());
+    EXPECT_TRUE(collector->getCameraNodeID(u"loc2"_s).isEmpty()); // exact match only
+    emit control->addLocation(u"New"_s, location(u"Loc9"_s));
+    EXPECT_EQ(collector->getCameraNodeID(u"Loc9"_s), u"New"_s);
+    emit control->updateLocations(QVariantMap{{u"Mid"_s, location(u"Loc1"_s)}});
+    EXPECT_EQ(collector->getCameraNodeID(u"Loc1"_s), u"Mid"_s);
+    EXPECT_TRUE(collector->getCameraNodeID(u"Loc9"_s).isEmpty());
 }
 
 TEST_F(CollectorTest, LocationLookupFromRequestThreadsWhileSlotsChangeTheMap)
 {
-    const QVariantMap first{{QStringLiteral("A"), location(QStringLiteral("Loc1"))},
-                            {QStringLiteral("B"), location(QStringLiteral("Loc2"))}};
-    const QVariantMap second{{QStringLiteral("C"), location(QStringLiteral("Loc1"))}};
+    const QVariantMap first{{u"A"_s, location(u"Loc1"_s)}, {u"B"_s, location(u"Loc2"_s)}};
+    const QVariantMap second{{u"C"_s, location(u"Loc1"_s)}};
     emit control->updateLocations(first);
     std::atomic<bool> stop{false};
     std::atomic<int> wrong{0};
@@ -210,10 +203,9 @@ TEST_F(CollectorTest, LocationLookupFromRequestThreadsWhileSlotsChangeTheMap)
     for (int i = 0; i < 3; ++i) {
         readers.emplace_back(QThread::create([&]() {
             while (!stop) {
-                const QString one = collector->getCameraNodeID(QStringLiteral("Loc1"));
-                const QString two = collector->getCameraNodeID(QStringLiteral("Loc2"));
-                if ((one != QStringLiteral("A") && one != QStringLiteral("C")) ||
-                    (two != QStringLiteral("B") && !two.isEmpty())) {
+                const QString one = collector->getCameraNodeID(u"Loc1"_s);
+                const QString two = collector->getCameraNodeID(u"Loc2"_s);
+                if ((one != u"A"_s && one != u"C"_s) || (two != u"B"_s && !two.isEmpty())) {
                     ++wrong;
                 }
                 lookups += 2;
@@ -223,8 +215,8 @@ TEST_F(CollectorTest, LocationLookupFromRequestThreadsWhileSlotsChangeTheMap)
     }
     for (int round = 0; round < 2000; ++round) {
         emit control->updateLocations(round % 2 ? first : second);
-        emit control->addLocation(QStringLiteral("D"), location(QStringLiteral("Loc3")));
-        emit control->removeLocation(QStringLiteral("D"));
+        emit control->addLocation(u"D"_s, location(u"Loc3"_s));
+        emit control->removeLocation(u"D"_s);
     }
     stop = true;
     for (auto& reader : readers) {
@@ -236,8 +228,7 @@ TEST_F(CollectorTest, LocationLookupFromRequestThreadsWhileSlotsChangeTheMap)
 
 TEST_F(CollectorTest, WriteDataSendsTheObjectsWithIdRangeAndFilteredThumbnails)
 {
-    collector->setDelvixSettings(
-        QVariantMap{{QStringLiteral("faceEnable"), false}, {QStringLiteral("LPREnable"), true}});
+    collector->setDelvixSettings(QVariantMap{{u"faceEnable"_s, false}, {u"LPREnable"_s, true}});
     const QString body = QStringLiteral(
         R"({"ObjectMetaInfo":[{"ID":5,"ObjectType":"Human","FaceThumbnail":[{"image":"f"}],)"
         R"("LicensePlateThumbnail":[{"image":"p"}]},{"ID":3,"FaceThumbnail":[]},{"ID":9}],"Other":1})");
@@ -257,21 +248,20 @@ TEST_F(CollectorTest, WriteDataSendsTheObjectsWithIdRangeAndFilteredThumbnails)
     // Defaults keep both; an empty settings map drops both.
     collector = std::make_unique<CameraInformationCollector>(&tools);
     collector->writeData(1, 1, body);
-    EXPECT_TRUE(infoOf(sentMetaInfo()->info.strContent).contains(QStringLiteral("FaceThumbnail")));
-    EXPECT_TRUE(infoOf(sentMetaInfo()->info.strContent).contains(QStringLiteral("LicensePlateThumbnail")));
+    EXPECT_TRUE(infoOf(sentMetaInfo()->info.strContent).contains(u"FaceThumbnail"_s));
+    EXPECT_TRUE(infoOf(sentMetaInfo()->info.strContent).contains(u"LicensePlateThumbnail"_s));
     collector->setDelvixSettings(QVariantMap());
     collector->writeData(1, 1, body);
-    EXPECT_FALSE(infoOf(sentMetaInfo()->info.strContent).contains(QStringLiteral("Thumbnail\"")));
-    EXPECT_FALSE(infoOf(sentMetaInfo()->info.strContent).contains(QStringLiteral("LicensePlate")));
+    EXPECT_FALSE(infoOf(sentMetaInfo()->info.strContent).contains(u"Thumbnail\""_s));
+    EXPECT_FALSE(infoOf(sentMetaInfo()->info.strContent).contains(u"LicensePlate"_s));
 }
 
 TEST_F(CollectorTest, WriteDataSendsNothingWithoutObjects)
 {
     for (const QString& body :
-         {QString(), QStringLiteral("not json"), QStringLiteral(R"({"ObjectMetaInfo":[]})"),
-          QStringLiteral(R"({"ObjectMetaInfo":{"ID":1}})"), QStringLiteral(R"({"Other":[1]})"),
-          QStringLiteral(R"([{"ObjectMetaInfo":[{"ID":1}]}])"),
-          QStringLiteral(R"({"ObjectMetaInfo":[{"ID":1}])")}) {
+         {QString(), u"not json"_s, uR"({"ObjectMetaInfo":[]})"_s, uR"({"ObjectMetaInfo":{"ID":1}})"_s,
+          uR"({"Other":[1]})"_s, uR"([{"ObjectMetaInfo":[{"ID":1}]}])"_s,
+          uR"({"ObjectMetaInfo":[{"ID":1}])"_s}) {
         collector->writeData(1, 1, body);
         EXPECT_EQ(sentMetaInfo(), nullptr) << qPrintable(body);
     }
@@ -286,9 +276,8 @@ TEST_F(CollectorTest, WriteDataKeepsTextSafeAndIntact)
     EXPECT_EQ(
         infoOf(content),
         QString::fromUtf8(R"({"ObjectMetaInfo":[{"ID":10000000000,"PlateNumber":"京A&lt;b&gt;&amp;%1"}]})"));
-    EXPECT_TRUE(
-        content.contains(QStringLiteral("<StartTime>10000000000</StartTime><EndTime>10000000000</EndTime>")));
-    EXPECT_EQ(content.count(QStringLiteral("<Info>")), 1);
+    EXPECT_TRUE(content.contains(u"<StartTime>10000000000</StartTime><EndTime>10000000000</EndTime>"_s));
+    EXPECT_EQ(content.count(u"<Info>"_s), 1);
 
     // Text without markup is byte-identical to the compact JSON.
     const QString clean = QString::fromUtf8(R"({"ObjectMetaInfo":[{"ID":1,"Name":"Zoë"}]})");
@@ -297,31 +286,25 @@ TEST_F(CollectorTest, WriteDataKeepsTextSafeAndIntact)
               QJsonDocument::fromJson(clean.toUtf8()).toJson(QJsonDocument::Compact));
 
     // Characters XML does not allow at all go out as their JSON escapes: same text, readable XML.
-    const QString nonCharacters =
-        QStringLiteral("{\"ObjectMetaInfo\":[{\"ID\":1,\"N\":\"a\uFFFFb\uFFFE\"}]}");
+    const QString nonCharacters = u"{\"ObjectMetaInfo\":[{\"ID\":1,\"N\":\"a\uFFFFb\uFFFE\"}]}"_s;
     collector->writeData(2, 3, nonCharacters);
     const QString sentText = sentMetaInfo()->info.strContent;
-    EXPECT_EQ(infoOf(sentText), QStringLiteral(R"({"ObjectMetaInfo":[{"ID":1,"N":"a\uffffb\ufffe"}]})"));
+    EXPECT_EQ(infoOf(sentText), uR"({"ObjectMetaInfo":[{"ID":1,"N":"a\uffffb\ufffe"}]})"_s);
     Quellon quellon;
-    const QString readBack = quellon.parse(sentText)
-                                 .toMap()
-                                 .value(QStringLiteral("InputObjectMetaInfo"))
-                                 .toMap()
-                                 .value(QStringLiteral("Info"))
-                                 .toString();
+    const QString readBack =
+        quellon.parse(sentText).toMap().value(u"InputObjectMetaInfo"_s).toMap().value(u"Info"_s).toString();
     EXPECT_EQ(QJsonDocument::fromJson(readBack.toUtf8()), QJsonDocument::fromJson(nonCharacters.toUtf8()));
 
     // An object without ID (or not an object at all) reads as 0 and goes out with ID null.
-    collector->writeData(2, 3, QStringLiteral(R"({"ObjectMetaInfo":[{"ID":4},{"X":1},7]})"));
+    collector->writeData(2, 3, uR"({"ObjectMetaInfo":[{"ID":4},{"X":1},7]})"_s);
     const QString third = sentMetaInfo()->info.strContent;
-    EXPECT_TRUE(third.contains(QStringLiteral("<StartTime>0</StartTime><EndTime>4</EndTime>")));
-    EXPECT_EQ(infoOf(third),
-              QStringLiteral(R"({"ObjectMetaInfo":[{"ID":4},{"ID":null,"X":1},{"ID":null}]})"));
+    EXPECT_TRUE(third.contains(u"<StartTime>0</StartTime><EndTime>4</EndTime>"_s));
+    EXPECT_EQ(infoOf(third), uR"({"ObjectMetaInfo":[{"ID":4},{"ID":null,"X":1},{"ID":null}]})"_s);
 
     // Negative group and location numbers are written signed.
-    collector->writeData(-1, -2, QStringLiteral(R"({"ObjectMetaInfo":[{"ID":1}]})"));
+    collector->writeData(-1, -2, uR"({"ObjectMetaInfo":[{"ID":1}]})"_s);
     EXPECT_TRUE(sentMetaInfo()->info.strContent.startsWith(
-        QStringLiteral("<InputObjectMetaInfo><GroupID>-1</GroupID><LocationID>-2</LocationID>")));
+        u"<InputObjectMetaInfo><GroupID>-1</GroupID><LocationID>-2</LocationID>"_s));
 
     // A refused request changes nothing else.
     client.accept = false;
@@ -337,12 +320,12 @@ TEST(CollectorWithHastyClient, AnswersArrivingDuringConstructionAreNotLost)
     client.onInsert = [&client](int index) {
         const QString cmd = client.requests.at(index).cmdName;
         if (cmd == QLatin1String("GetNodeInfo")) {
-            client.answer(index, true, QStringLiteral("0"),
+            client.answer(index, true, u"0"_s,
                           QStringLiteral("<NodeInfo><Cameras><Cam><Name>A</Name><ObjectMetaRecordCap>true"
                                          "</ObjectMetaRecordCap></Cam></Cameras></NodeInfo>"));
         } else if (cmd == QLatin1String("QryLocs")) {
             client.answer(
-                index, true, QStringLiteral("0"),
+                index, true, u"0"_s,
                 QStringLiteral("<LocRecs><LocList><Live>true</Live><Loc><Alias>A</Alias><Name>Loc1</Name>"
                                "<GrpID>1</GrpID></Loc></LocList></LocRecs>"));
         } else if (cmd == QLatin1String("SubCamStatus")) {
@@ -354,14 +337,14 @@ TEST(CollectorWithHastyClient, AnswersArrivingDuringConstructionAreNotLost)
     };
     FakeTools tools(&client);
     CameraInformationCollector collector(&tools);
-    EXPECT_EQ(collector.cameraDirectory().keys(), QStringList{QStringLiteral("A")});
-    EXPECT_EQ(collector.getCameraNodeID(QStringLiteral("Loc1")), QStringLiteral("A"));
+    EXPECT_EQ(collector.cameraDirectory().keys(), QStringList{u"A"_s});
+    EXPECT_EQ(collector.getCameraNodeID(u"Loc1"_s), u"A"_s);
 }
 
 TEST(CollectorWithoutClient, WorksWithoutTunnelClient)
 {
     CameraInformationCollector collector(nullptr);
-    collector.writeData(1, 1, QStringLiteral(R"({"ObjectMetaInfo":[{"ID":1}]})"));
-    EXPECT_TRUE(collector.getCameraNodeID(QStringLiteral("Loc1")).isEmpty());
+    collector.writeData(1, 1, uR"({"ObjectMetaInfo":[{"ID":1}]})"_s);
+    EXPECT_TRUE(collector.getCameraNodeID(u"Loc1"_s).isEmpty());
     EXPECT_FALSE(collector.getNOVIRSrvTunnelControl().isNull());
 }

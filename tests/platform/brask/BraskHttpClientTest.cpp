@@ -11,6 +11,8 @@
 
 #include <thread>
 
+using namespace Qt::StringLiterals;
+
 namespace {
 
 struct Outcome
@@ -49,47 +51,47 @@ protected:
     void SetUp() override
     {
         CameraSetup basic;
-        basic.name = QStringLiteral("basic");
-        basic.password = QStringLiteral("s3cret");
+        basic.name = u"basic"_s;
+        basic.password = u"s3cret"_s;
         CameraSetup digest = basic;
-        digest.name = QStringLiteral("digest");
+        digest.name = u"digest"_s;
         digest.digestAuth = true;
         CameraSetup tls = basic;
-        tls.name = QStringLiteral("tls");
+        tls.name = u"tls"_s;
         tls.useSSL = true;
         CameraSetup guarded = basic;
-        guarded.name = QStringLiteral("guarded");
+        guarded.name = u"guarded"_s;
         guarded.protectedMetadata = true;
         QString error;
         ASSERT_TRUE(m_cameras.start({basic, digest, tls, guarded}, &error)) << qPrintable(error);
     }
 
+    // The completion every call gets: it records what it was told, and on which thread.
+    static BraskHttpClient::Completion recordInto(const std::shared_ptr<Outcome>& outcome)
+    {
+        return [outcome](QNetworkReply::NetworkError error, const QByteArray& headers, const QByteArray& body,
+                         bool abandoned) {
+            ++outcome->calls;
+            outcome->error = error;
+            outcome->headers = headers;
+            outcome->body = body;
+            outcome->abandoned = abandoned;
+            outcome->thread = QThread::currentThread();
+        };
+    }
+
     std::shared_ptr<Outcome> get(BraskHttpClient& client, const QString& camera, const QString& path,
-                                 const QString& password = QStringLiteral("s3cret"),
-                                 unsigned int timeoutMs = 5000, bool* accepted = nullptr)
+                                 const QString& password = u"s3cret"_s, unsigned int timeoutMs = 5000)
     {
         auto outcome = std::make_shared<Outcome>();
-        const bool ok = client.Get(QStringLiteral("127.0.0.1"), path, m_cameras.port(camera), camera == "tls",
-                                   QStringLiteral("admin"), password,
-                                   [outcome](QNetworkReply::NetworkError error, const QByteArray& headers,
-                                             const QByteArray& body, bool abandoned) {
-                                       ++outcome->calls;
-                                       outcome->error = error;
-                                       outcome->headers = headers;
-                                       outcome->body = body;
-                                       outcome->abandoned = abandoned;
-                                       outcome->thread = QThread::currentThread();
-                                   },
-                                   timeoutMs, {});
-        if (accepted) {
-            *accepted = ok;
-        }
+        client.Get(u"127.0.0.1"_s, path, m_cameras.port(camera), camera == "tls", u"admin"_s, password,
+                   recordInto(outcome), timeoutMs, {});
         EXPECT_EQ(outcome->calls, 0) << "completion ran inside Get";
         return outcome;
     }
 
     std::shared_ptr<Outcome> fetch(BraskHttpClient& client, const QString& camera, const QString& path,
-                                   const QString& password = QStringLiteral("s3cret"))
+                                   const QString& password = u"s3cret"_s)
     {
         auto outcome = get(client, camera, path, password);
         EXPECT_TRUE(waitFor([&] { return outcome->calls > 0; }));
@@ -98,10 +100,7 @@ protected:
         return outcome;
     }
 
-    static QString window()
-    {
-        return QStringLiteral("/VCA/Data/DB/ObjectMeta?StartTime=1000&EndTime=1060&Info=127");
-    }
+    static QString window() { return u"/VCA/Data/DB/ObjectMeta?StartTime=1000&EndTime=1060&Info=127"_s; }
 
     CameraSimulator m_cameras;
 };
@@ -150,14 +149,12 @@ TEST_F(BraskHttpClientTest, SelfSignedCertificateAcceptedOnLoopbackOnlyWhenAllow
     BraskHttpClient verifying(strict);
     EXPECT_EQ(fetch(verifying, "tls", window())->error, QNetworkReply::SslHandshakeFailedError);
 
-    EXPECT_TRUE(BraskHttpClient::isLocalNetworkHost("127.0.0.1"));
-    EXPECT_TRUE(BraskHttpClient::isLocalNetworkHost("192.168.3.7"));
-    EXPECT_TRUE(BraskHttpClient::isLocalNetworkHost("172.20.0.1"));
-    EXPECT_TRUE(BraskHttpClient::isLocalNetworkHost("fe80::1"));
-    EXPECT_TRUE(BraskHttpClient::isLocalNetworkHost("LOCALHOST"));
-    EXPECT_FALSE(BraskHttpClient::isLocalNetworkHost("172.32.0.1"));
-    EXPECT_FALSE(BraskHttpClient::isLocalNetworkHost("8.8.8.8"));
-    EXPECT_FALSE(BraskHttpClient::isLocalNetworkHost("camera.example.com"));
+    for (const char* host : {"127.0.0.1", "192.168.3.7", "172.20.0.1", "fe80::1", "LOCALHOST"}) {
+        EXPECT_TRUE(BraskHttpClient::isLocalNetworkHost(host)) << host;
+    }
+    for (const char* host : {"172.32.0.1", "8.8.8.8", "camera.example.com"}) {
+        EXPECT_FALSE(BraskHttpClient::isLocalNetworkHost(host)) << host;
+    }
 }
 
 TEST_F(BraskHttpClientTest, RefusedTimedOutAndInvalidCallsStillCompleteOnce)
@@ -170,12 +167,7 @@ TEST_F(BraskHttpClientTest, RefusedTimedOutAndInvalidCallsStillCompleteOnce)
         closedPort = probe.serverPort();
     }
     auto refused = std::make_shared<Outcome>();
-    client.Get("127.0.0.1", window(), closedPort, false, "admin", "x",
-               [refused](QNetworkReply::NetworkError error, const QByteArray&, const QByteArray&, bool) {
-                   ++refused->calls;
-                   refused->error = error;
-               },
-               5000, {});
+    client.Get("127.0.0.1", window(), closedPort, false, "admin", "x", recordInto(refused), 5000, {});
     ASSERT_TRUE(waitFor([&] { return refused->calls > 0; }));
     EXPECT_EQ(refused->error, QNetworkReply::ConnectionRefusedError);
 
@@ -185,16 +177,8 @@ TEST_F(BraskHttpClientTest, RefusedTimedOutAndInvalidCallsStillCompleteOnce)
     EXPECT_EQ(late->error, QNetworkReply::TimeoutError);
     EXPECT_TRUE(late->abandoned);
 
-    bool accepted = true;
     auto invalid = std::make_shared<Outcome>();
-    accepted =
-        client.Get("127.0.0.1", window(), 0, false, "", "",
-                   [invalid](QNetworkReply::NetworkError error, const QByteArray&, const QByteArray&, bool) {
-                       ++invalid->calls;
-                       invalid->error = error;
-                   },
-                   5000, {});
-    EXPECT_FALSE(accepted);
+    EXPECT_FALSE(client.Get("127.0.0.1", window(), 0, false, "", "", recordInto(invalid), 5000, {}));
     EXPECT_EQ(invalid->calls, 0);
     ASSERT_TRUE(waitFor([&] { return invalid->calls > 0; }));
     EXPECT_EQ(invalid->error, QNetworkReply::ProtocolInvalidOperationError);

@@ -9,18 +9,21 @@
 
 #include <QCoreApplication>
 #include <QDir>
+#include <QFileInfo>
 #include <QJsonDocument>
 #include <QTemporaryDir>
 #include <cstdint>
+#include <cstdio>
 #include <cstdlib>
 #include <set>
 #include <string>
 
 namespace {
 
-void check(bool condition)
+void check(bool condition, const char* what)
 {
     if (!condition) {
+        std::fprintf(stderr, "fuzz_store_ingest: %s\n", what);
         std::abort();
     }
 }
@@ -28,6 +31,14 @@ void check(bool condition)
 bool isJsonObject(const char* text)
 {
     return text && QJsonDocument::fromJson(QByteArray(text)).isObject();
+}
+
+// Stores and vaults write through to their files on every change; a memory file system, where
+// there is one, keeps an input at milliseconds rather than at the disk's sync time.
+QString scratchFolder()
+{
+    const QFileInfo memory(QStringLiteral("/dev/shm"));
+    return memory.isDir() && memory.isWritable() ? memory.filePath() : QDir::tempPath();
 }
 
 // A storage folder per generation of inputs, one location per input within it; the folder of a
@@ -39,11 +50,13 @@ public:
     static constexpr int kGenerationsKept = 6;
 
     Storage()
-        : m_root(QDir::temp().filePath(QStringLiteral("fuzz_store_ingest-XXXXXX")))
+        : m_root(QDir(scratchFolder()).filePath(QStringLiteral("fuzz_store_ingest-XXXXXX")))
     {
-        check(m_root.isValid());
+        check(m_root.isValid(), "no temporary folder");
     }
     ~Storage() { close(); }
+
+    QString folder() const { return m_root.path(); }
 
     // The database handle and the location for the next input.
     void* next(uint32_t* location)
@@ -62,9 +75,9 @@ private:
         ++m_generation;
         QDir(m_root.filePath(QString::number(m_generation - kGenerationsKept))).removeRecursively();
         unsigned char record[704] = {0xC0, 0x02}; // wSize 704
-        check(Tamsa_InitDatabase(&m_database, record, 0) == TAMSA_OK);
+        check(Tamsa_InitDatabase(&m_database, record, 0) == TAMSA_OK, "no database handle");
         const QByteArray path = m_root.filePath(QString::number(m_generation)).toUtf8();
-        check(Tamsa_SetStoragesDBPath(m_database, path.constData()) == TAMSA_OK);
+        check(Tamsa_SetStoragesDBPath(m_database, path.constData()) == TAMSA_OK, "no storage folder");
         m_location = 0;
     }
     void close()
@@ -93,6 +106,9 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     static QCoreApplication* app = QCoreApplication::instance() ? nullptr : new QCoreApplication(argc, argv);
     (void)app;
     static Storage* storage = new Storage;
+    // The objects stay to the end (threads may still use them); only their files go then.
+    static const int removal = std::atexit([]() { QDir(storage->folder()).removeRecursively(); });
+    (void)removal;
 
     uint32_t location = 0;
     void* database = storage->next(&location);
@@ -100,7 +116,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     // A C text: whatever follows a NUL is not part of it.
     const std::string text(reinterpret_cast<const char*>(data + 1), size - 1);
     const int32_t stored = Tamsa_PutObjectMetaInfo(database, groupId, int32_t(location), text.c_str());
-    check(stored >= 0 || stored == TAMSA_E_BAD_JSON);
+    check(stored >= 0 || stored == TAMSA_E_BAD_JSON,
+          "an ingest status that is neither a count nor a refusal");
 
     const uint32_t locations[] = {location, 0};
     TTAMSA_OBJECTMETAINFO_QUERY query{};
@@ -109,7 +126,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     query.dwEndTime = 0xFFFFFFFFu;
     query.pdwLocationIds = locations;
     void* search = nullptr;
-    check(Tamsa_GetObjectMetaInfoFirst(database, &query, &search) == TAMSA_OK);
+    check(Tamsa_GetObjectMetaInfoFirst(database, &query, &search) == TAMSA_OK, "the read-back search failed");
     std::set<uint64_t> ids;
     int32_t status = TAMSA_OK;
     for (;;) {
@@ -119,21 +136,22 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
         if (status != TAMSA_OK) {
             break;
         }
-        check(result.dwLocationNumber == location);
-        check(ids.insert(result.qwObjectId).second);
-        check(result.pszObjectType != nullptr);
-        check(result.dwStartTime <= result.dwEndTime);
-        check(result.dwTrajectoryBytes % 16 == 0);
-        check(result.dwTrajectoryBytes == 0 || result.pTrajectory != nullptr);
+        check(result.dwLocationNumber == location, "an object of another location");
+        check(ids.insert(result.qwObjectId).second, "an ID handed out twice");
+        check(result.pszObjectType != nullptr, "no object type");
+        check(result.dwStartTime <= result.dwEndTime, "an end before the start");
+        check(result.dwTrajectoryBytes % 16 == 0, "a trajectory of partial points");
+        check(result.dwTrajectoryBytes == 0 || result.pTrajectory != nullptr,
+              "trajectory bytes without points");
         for (uint32_t i = 0; i < result.dwTrajectoryBytes / sizeof(double); ++i) {
             volatile double coordinate = result.pTrajectory[i]; // every byte counted is readable
             (void)coordinate;
         }
-        check(isJsonObject(result.pszAttributes));
-        check(isJsonObject(result.pszThumbnails));
+        check(isJsonObject(result.pszAttributes), "attributes that are not a JSON object");
+        check(isJsonObject(result.pszThumbnails), "thumbnails that are not a JSON object");
     }
     Tamsa_GetObjectMetaInfoClose(search);
-    check(status == TAMSA_E_NO_MORE_RECORDS);
-    check(ids.size() == size_t(stored > 0 ? stored : 0));
+    check(status == TAMSA_E_NO_MORE_RECORDS, "the read-back ended in a failure");
+    check(ids.size() == size_t(stored > 0 ? stored : 0), "not as many objects read back as stored");
     return 0;
 }

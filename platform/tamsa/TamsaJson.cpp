@@ -244,6 +244,39 @@ private:
         }
     }
 
+    // Length of the well-formed UTF-8 sequence at p (no overlong forms, no surrogates, nothing
+    // above U+10FFFF), or 0. The texts the store hands out are read by strict JSON readers that
+    // refuse a whole text over one bad byte, so the store must not take such bytes in.
+    static size_t utf8Length(const unsigned char* p, const unsigned char* end)
+    {
+        const unsigned char c = p[0];
+        size_t length = 0;
+        unsigned char low = 0x80;
+        unsigned char high = 0xBF;
+        if (c >= 0xC2 && c <= 0xDF) {
+            length = 2;
+        } else if (c >= 0xE0 && c <= 0xEF) {
+            length = 3;
+            low = c == 0xE0 ? 0xA0 : 0x80;
+            high = c == 0xED ? 0x9F : 0xBF;
+        } else if (c >= 0xF0 && c <= 0xF4) {
+            length = 4;
+            low = c == 0xF0 ? 0x90 : 0x80;
+            high = c == 0xF4 ? 0x8F : 0xBF;
+        } else {
+            return 0;
+        }
+        if (size_t(end - p) < length || p[1] < low || p[1] > high) {
+            return 0;
+        }
+        for (size_t i = 2; i < length; ++i) {
+            if (p[i] < 0x80 || p[i] > 0xBF) {
+                return 0;
+            }
+        }
+        return length;
+    }
+
     bool parseString(std::string* out)
     {
         ++m_p; // opening quote
@@ -260,6 +293,15 @@ private:
             }
             if (c < 0x20) {
                 return false;
+            }
+            if (c >= 0x80) {
+                const size_t length = utf8Length(reinterpret_cast<const unsigned char*>(m_p),
+                                                 reinterpret_cast<const unsigned char*>(m_end));
+                if (length == 0) {
+                    return false;
+                }
+                m_p += length;
+                continue;
             }
             if (c != '\\') {
                 ++m_p;

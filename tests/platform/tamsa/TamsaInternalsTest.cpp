@@ -98,9 +98,24 @@ TEST(TamsaJson, ParsesAndWritesDocumentsAndRefusesBrokenOnes)
     ASSERT_TRUE(tamsa::JsonValue::parse("18446744073709551615", &id));
     EXPECT_EQ(id.serialize(), "18446744073709551615") << "numbers keep their text";
     for (const char* bad : {"", "{", "[1,]", "{\"a\"}", "{\"a\":1,}", "01", "\"\x01\"", "[1] x", "tru", "NaN",
-                            "\"\\q\"", "\"\\u12\""}) {
+                            "\"\\q\"", "\"\\u12\"",
+                            // Not UTF-8: a stray continuation byte, a cut sequence, overlong forms,
+                            // an encoded surrogate, beyond U+10FFFF, bytes UTF-8 never uses.
+                            "\"a\x97\"",
+                            "\"\xC7"
+                            "4\"",
+                            "\"\xE4\xBA\"", "\"\xC0\xAF\"", "\"\xE0\x80\xAF\"", "\"\xED\xA0\x80\"",
+                            "\"\xF4\x90\x80\x80\"", "\"\xF8\x88\x80\x80\x80\"", "\"\xFF\"", "{\"\xE9\":1}"}) {
         EXPECT_FALSE(tamsa::JsonValue::parse(bad, &value)) << bad;
     }
+    // Every well-formed sequence length, at the edges of what is allowed.
+    ASSERT_TRUE(
+        tamsa::JsonValue::parse("\"\xC2\x80\xDF\xBF\xE0\xA0\x80\xED\x9F\xBF\xEE\x80\x80\xF0\x90\x80\x80"
+                                "\xF4\x8F\xBF\xBF\xE4\xBA\xAC\"",
+                                &value));
+    EXPECT_EQ(
+        value.text,
+        "\xC2\x80\xDF\xBF\xE0\xA0\x80\xED\x9F\xBF\xEE\x80\x80\xF0\x90\x80\x80\xF4\x8F\xBF\xBF\xE4\xBA\xAC");
     EXPECT_FALSE(tamsa::JsonValue::parse(std::string(200000, '['), &value));
     EXPECT_FALSE(tamsa::JsonValue::parse(std::string(100000, '{'), &value));
     EXPECT_TRUE(tamsa::JsonValue::parse(std::string(60, '[') + std::string(60, ']'), &value));

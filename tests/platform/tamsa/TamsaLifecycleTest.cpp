@@ -86,6 +86,13 @@ TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
     EXPECT_EQ(putText(1, R"({"Objects":[]})"), TAMSA_E_BAD_JSON);
     EXPECT_EQ(putText(1, R"({"ObjectMetaInfo":{}})"), TAMSA_E_BAD_JSON);
     EXPECT_EQ(putText(1, std::string(100000, '[') + std::string(100000, ']')), TAMSA_E_BAD_JSON);
+    // A byte that is not UTF-8 makes the answer unreadable, as it would be to any reader of the
+    // texts the store hands out.
+    EXPECT_EQ(putText(1, R"({"ObjectMetaInfo":[{"ID":3,"ObjectType":"Human","StartTime":1,"EndTime":2,)"
+                         R"("Attributes":{"Age":")"
+                         "\x97"
+                         R"("}}]})"),
+              TAMSA_E_BAD_JSON);
     EXPECT_EQ(putText(1, R"({"ObjectMetaInfo":[]})"), 0);
     EXPECT_EQ(putText(0, R"({"ObjectMetaInfo":[]})"), TAMSA_E_INVALID_ARGUMENT);
     EXPECT_EQ(Tamsa_PutObjectMetaInfo(m_database, 1, 1, nullptr), TAMSA_E_INVALID_ARGUMENT);

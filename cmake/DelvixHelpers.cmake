@@ -66,7 +66,9 @@ function(delvix_test name)
     set(discovery 60)
   endif()
   math(EXPR timeout "${timeout} * ${scale}")
-  target_compile_definitions(${name} PRIVATE DELVIX_TEST_TIME_SCALE=${scale})
+  if(scale GREATER 1)
+    target_compile_definitions(${name} PRIVATE DELVIX_TEST_TIME_SCALE=${scale}) # the tests' default is 1
+  endif()
   gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT ${discovery} PROPERTIES TIMEOUT ${timeout})
 endfunction()
 

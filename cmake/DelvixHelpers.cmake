@@ -44,7 +44,7 @@ endfunction()
 # registers every test case with CTest. Tests get the shared main (with a
 # QCoreApplication) from delvix_test_support unless they bring their own.
 function(delvix_test name)
-  cmake_parse_arguments(ARG "" "TIMEOUT" "SOURCES;LIBS;DEFINES" ${ARGN})
+  cmake_parse_arguments(ARG "NO_LEAK_CHECK" "TIMEOUT" "SOURCES;LIBS;DEFINES" ${ARGN})
   add_executable(${name} ${ARG_SOURCES})
   target_link_libraries(${name} PRIVATE delvix_test_support ${ARG_LIBS})
   target_compile_options(${name} PRIVATE ${DELVIX_WARNINGS})
@@ -69,7 +69,12 @@ function(delvix_test name)
   if(scale GREATER 1)
     target_compile_definitions(${name} PRIVATE DELVIX_TEST_TIME_SCALE=${scale}) # the tests' default is 1
   endif()
-  gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT ${discovery} PROPERTIES TIMEOUT ${timeout})
+  set(properties TIMEOUT ${timeout})
+  if(ARG_NO_LEAK_CHECK AND DELVIX_SANITIZE STREQUAL "address")
+    # Address checking stays; only the leak check at exit is off (the caller says why).
+    list(APPEND properties ENVIRONMENT_MODIFICATION "ASAN_OPTIONS=string_append::detect_leaks=0")
+  endif()
+  gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST DISCOVERY_TIMEOUT ${discovery} PROPERTIES ${properties})
 endfunction()
 
 # delvix_bench(NAME SOURCES ... [LIBS ...]) builds a Google Benchmark executable (not a CTest test:

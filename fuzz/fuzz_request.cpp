@@ -374,8 +374,14 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     static QCoreApplication* app = QCoreApplication::instance() ? nullptr : new QCoreApplication(argc, argv);
     (void)app;
     static Host* host = new Host;
-    // The objects stay to the end (threads may still use them); only their files go then.
-    static const int removal = std::atexit([]() { QDir(host->folder()).removeRecursively(); });
+    // Taken down at exit, before the libraries' own statics: the plug-in joins its search thread
+    // (a finished one is only joined by the next search or by the plug-in going away) and the
+    // folders go with the host.
+    static const int removal = std::atexit([]() {
+        const QString folder = host->folder();
+        delete host;
+        QDir(folder).removeRecursively();
+    });
     (void)removal;
 
     const QByteArray input = QByteArray::fromRawData(reinterpret_cast<const char*>(data), qsizetype(size));

@@ -113,17 +113,17 @@ class TamsaStorageFaultTest : public TamsaStoreFixture
 protected:
     static ObjectSpec object(uint64_t id)
     {
-        ObjectSpec spec;
-        spec.id = id;
-        spec.start = uint32_t(1000 + id);
-        spec.end = spec.start + 5;
-        spec.attributes =
+        ObjectSpec made;
+        made.id = id;
+        made.start = uint32_t(1000 + id);
+        made.end = made.start + 5;
+        made.attributes =
             R"({"Gender":)" + std::to_string(id % 2) + R"(,"Tag":"object )" + std::to_string(id) + "\"}";
-        spec.body = randomUnitVector(uint32_t(id));
+        made.body = randomUnitVector(uint32_t(id));
         if (id % 3 == 0) {
-            spec.face = randomUnitVector(uint32_t(id + 100000));
+            made.face = randomUnitVector(uint32_t(id + 100000));
         }
-        return spec;
+        return made;
     }
 
     static std::vector<ObjectSpec> objects(uint64_t firstId, size_t count)
@@ -321,8 +321,8 @@ TEST_F(TamsaStorageFaultTest, FullDirectoryRefusesIngestWithoutLosingAcknowledge
                 EXPECT_TRUE(result == TAMSA_E_IO || result == TAMSA_E_BUSY) << result;
             } else {
                 EXPECT_EQ(result, 12);
-                for (const ObjectSpec& spec : batch) {
-                    acknowledged.insert(spec.id);
+                for (const ObjectSpec& stored : batch) {
+                    acknowledged.insert(stored.id);
                 }
             }
             nextId += 100;

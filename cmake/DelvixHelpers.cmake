@@ -2,6 +2,14 @@
 
 set(DELVIX_WARNINGS -Wall -Wextra)
 
+# How many times slower than a plain build the tests run (ThreadSanitizer most), listing included.
+set(DELVIX_TEST_TIME_SCALE 1)
+if(DELVIX_SANITIZE STREQUAL "thread")
+  set(DELVIX_TEST_TIME_SCALE 4)
+elseif(DELVIX_SANITIZE STREQUAL "address")
+  set(DELVIX_TEST_TIME_SCALE 2)
+endif()
+
 function(delvix_setup_sanitizers)
   if(DELVIX_SANITIZE STREQUAL "address")
     add_compile_options(-fsanitize=address,undefined -fno-omit-frame-pointer -fno-sanitize-recover=undefined)
@@ -53,22 +61,13 @@ function(delvix_test name)
   if(ARG_TIMEOUT)
     set(timeout ${ARG_TIMEOUT})
   endif()
-  # Instrumented builds run several times slower (ThreadSanitizer most), listing the tests included.
-  # The same factor scales CTest's limit and, through DELVIX_TEST_TIME_SCALE, the waits inside the
-  # tests, so that a slow build is never mistaken for a hang.
+  # Instrumented builds run several times slower: the same factor scales CTest's limit and, through
+  # DELVIX_TEST_TIME_SCALE (set on the test support library), the waits inside the tests.
   set(discovery 5)
-  set(scale 1)
-  if(DELVIX_SANITIZE STREQUAL "thread")
-    set(scale 4)
-    set(discovery 60)
-  elseif(DELVIX_SANITIZE STREQUAL "address")
-    set(scale 2)
+  if(DELVIX_TEST_TIME_SCALE GREATER 1)
     set(discovery 60)
   endif()
-  math(EXPR timeout "${timeout} * ${scale}")
-  if(scale GREATER 1)
-    target_compile_definitions(${name} PRIVATE DELVIX_TEST_TIME_SCALE=${scale}) # the tests' default is 1
-  endif()
+  math(EXPR timeout "${timeout} * ${DELVIX_TEST_TIME_SCALE}")
   set(properties TIMEOUT ${timeout})
   if(ARG_NO_LEAK_CHECK AND DELVIX_SANITIZE STREQUAL "address")
     # Address checking stays; only the leak check at exit is off (the caller says why).

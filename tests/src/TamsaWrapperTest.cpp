@@ -1,5 +1,5 @@
-// The store wrapper: the initialisation record it hands the store, and where it finds the
-// store's files (the machine settings, read here from a settings folder of the test's own).
+// The store wrapper: where it finds the store's files (the machine settings, read here from a
+// settings folder of the test's own), and that the record it hands the store opens a real one.
 #include "TamsaImplement.h"
 
 #include <QDir>
@@ -8,11 +8,9 @@
 
 #include <gtest/gtest.h>
 
-#include <cstring>
-
 namespace {
 
-class StoragePathTest : public ::testing::Test
+class TamsaWrapperTest : public ::testing::Test
 {
 protected:
     void SetUp() override
@@ -33,57 +31,30 @@ protected:
     QTemporaryDir m_settingsDir;
 };
 
-} // namespace
-
-TEST(TamsaWrapperTest, InitialisationRecordBytes)
+TEST_F(TamsaWrapperTest, StoragePathComesFromThe32BitKeyFirstThenTheNativeOne)
 {
-    const QByteArray record = TamsaWrapper::initRecord();
-    ASSERT_EQ(record.size(), 704);
-    const auto u16 = [&](int offset) {
-        uint16_t value;
-        std::memcpy(&value, record.constData() + offset, sizeof value);
-        return value;
-    };
-    const auto u32 = [&](int offset) {
-        uint32_t value;
-        std::memcpy(&value, record.constData() + offset, sizeof value);
-        return value;
-    };
-    EXPECT_EQ(u16(0), 704);
-    EXPECT_EQ(u16(2), 19);
-    EXPECT_EQ(u32(4), 5u);
-    EXPECT_EQ(u16(8), 1);
-    EXPECT_EQ(u32(668), 1u);
-    int nonZero = 0;
-    for (int i = 0; i < record.size(); ++i) {
-        const bool known = i < 10 || (i >= 668 && i < 672);
-        if (!known && record[i] != 0) {
-            ++nonZero;
-        }
-    }
-    EXPECT_EQ(nonZero, 0);
-}
-
-TEST_F(StoragePathTest, AbsentWhenNoKeyHoldsTheValue)
-{
+    const QString server = QDir::separator() + QStringLiteral("Server");
     write(QStringLiteral("Software/Other/INSTALL_PATH"), QStringLiteral("/elsewhere"));
-    TamsaImplement tamsa;
-    EXPECT_TRUE(tamsa.getStoragesDBPath().isEmpty());
-}
-
-TEST_F(StoragePathTest, NativeKeyWhenThe32BitKeyIsAbsent)
-{
-    write(QStringLiteral("Software/INSTALL_PATH"), QStringLiteral("/opt/novir"));
-    TamsaImplement tamsa;
-    EXPECT_EQ(tamsa.getStoragesDBPath(),
-              QStringLiteral("/opt/novir") + QDir::separator() + QStringLiteral("Server"));
-}
-
-TEST_F(StoragePathTest, The32BitKeyComesFirst)
-{
+    EXPECT_EQ(TamsaImplement().getStoragesDBPath(), QString()) << "no key holds the value";
     write(QStringLiteral("Software/INSTALL_PATH"), QStringLiteral("/opt/native"));
+    EXPECT_EQ(TamsaImplement().getStoragesDBPath(), QStringLiteral("/opt/native") + server);
     write(QStringLiteral("Software/WOW6432node/INSTALL_PATH"), QStringLiteral("/opt/wow"));
-    TamsaImplement tamsa;
-    EXPECT_EQ(tamsa.getStoragesDBPath(),
-              QStringLiteral("/opt/wow") + QDir::separator() + QStringLiteral("Server"));
+    EXPECT_EQ(TamsaImplement().getStoragesDBPath(), QStringLiteral("/opt/wow") + server);
 }
+
+TEST_F(TamsaWrapperTest, OpensTheStoreBelowTheInstallFolder)
+{
+    QTemporaryDir install;
+    ASSERT_TRUE(install.isValid());
+    write(QStringLiteral("Software/INSTALL_PATH"), install.path());
+    TamsaImplement tamsa;
+    void* database = nullptr;
+    EXPECT_EQ(tamsa.initDatabase(&database), TAMSA_OK);
+    ASSERT_NE(database, nullptr);
+    EXPECT_EQ(Tamsa_PutObjectMetaInfo(database, 1, 1, R"({"ObjectMetaInfo":[]})"), 0);
+    EXPECT_TRUE(QDir(install.filePath(QStringLiteral("Server"))).exists());
+    EXPECT_EQ(tamsa.releaseDatabase(&database), TAMSA_OK);
+    EXPECT_EQ(database, nullptr);
+}
+
+} // namespace

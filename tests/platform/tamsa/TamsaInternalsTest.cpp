@@ -1,5 +1,5 @@
-// The store's building blocks: record layout, the JSON reader/writer, the SIMD cosine kernel.
-#include "Tamsa.h"
+// The store's building blocks where a fault would only shift results slightly: the JSON reader and
+// writer of numbers and texts, and the SIMD cosine kernel against the plain loop.
 #include "TamsaCosine.h"
 #include "TamsaJson.h"
 
@@ -11,27 +11,6 @@
 #include <random>
 
 namespace {
-
-TEST(TamsaRecords, LayoutsAreByteExact)
-{
-    EXPECT_EQ(sizeof(TTAMSA_TZDS), 16u);
-    EXPECT_EQ(sizeof(TTAMSA_OBJECTMETAINFO_QUERY), 128u);
-    EXPECT_EQ(sizeof(TTAMSA_OBJECTMETAINFO_RESULT), 80u);
-    EXPECT_EQ(offsetof(TTAMSA_OBJECTMETAINFO_QUERY, tzds) + offsetof(TTAMSA_TZDS, wDaylight), 22u);
-    EXPECT_EQ(offsetof(TTAMSA_OBJECTMETAINFO_QUERY, pszPlateNumber), 120u);
-    EXPECT_EQ(offsetof(TTAMSA_OBJECTMETAINFO_RESULT, fFaceScore), 76u);
-    EXPECT_EQ(TAMSA_E_NO_MORE_RECORDS, int32_t(0x80431905u));
-    // Every failure code is distinct and non-zero.
-    const int32_t codes[] = {TAMSA_E_INVALID_ARGUMENT, TAMSA_E_NO_STORAGE_PATH, TAMSA_E_IO,
-                             TAMSA_E_ABORTED,          TAMSA_E_NO_MORE_RECORDS, TAMSA_E_BAD_JSON,
-                             TAMSA_E_BAD_QUERY,        TAMSA_E_OUT_OF_MEMORY,   TAMSA_E_BUSY};
-    for (size_t i = 0; i < std::size(codes); ++i) {
-        EXPECT_LT(codes[i], 0);
-        for (size_t j = i + 1; j < std::size(codes); ++j) {
-            EXPECT_NE(codes[i], codes[j]);
-        }
-    }
-}
 
 TEST(TamsaJson, FloatsWrittenReadBackExactly)
 {
@@ -54,14 +33,6 @@ TEST(TamsaJson, FloatsWrittenReadBackExactly)
         ++checked;
     }
     EXPECT_GT(checked, 250000);
-    for (float value : {0.5f, -0.25f, 1.0f, 100.0f, 0.0001f, 1e-7f, 3.4e38f}) {
-        const int length = tamsa::formatFloat(value, buffer);
-        EXPECT_EQ(std::strtof(std::string(buffer, length).c_str(), nullptr), value);
-    }
-    EXPECT_EQ(std::string(buffer, tamsa::formatFloat(0.5f, buffer)), "0.5");
-    EXPECT_EQ(std::string(buffer, tamsa::formatFloat(-12.0f, buffer)), "-12");
-    EXPECT_EQ(std::string(buffer, tamsa::formatFloat(0.125f, buffer)), "0.125");
-    EXPECT_EQ(std::string(buffer, tamsa::formatFloat(1e-7f, buffer)), "1.00000001e-7");
 }
 
 TEST(TamsaJson, NumbersParseLikeTheStandardLibrary)
@@ -88,12 +59,12 @@ TEST(TamsaJson, ParsesAndWritesDocumentsAndRefusesBrokenOnes)
 {
     tamsa::JsonValue value;
     ASSERT_TRUE(tamsa::JsonValue::parse(
-        R"( {"a":[1,2.5,-3],"b":"x\"\u00e9\ud83d\ude00","c":[1,"t",null],"d":{}} )", &value));
+        R"( {"a":[1,2.5,-3],"b":"x\"\u00e9\ud83d\ude00\ud800\udc00","c":[1,"t",null],"d":{}} )", &value));
     EXPECT_TRUE(value.member("a")->numberArray);
     EXPECT_FALSE(value.member("c")->numberArray);
-    EXPECT_EQ(value.member("b")->text, "x\"\xC3\xA9\xF0\x9F\x98\x80");
-    EXPECT_EQ(value.serialize(),
-              "{\"a\":[1,2.5,-3],\"b\":\"x\\\"\xC3\xA9\xF0\x9F\x98\x80\",\"c\":[1,\"t\",null],\"d\":{}}");
+    EXPECT_EQ(value.member("b")->text, "x\"\xC3\xA9\xF0\x9F\x98\x80\xF0\x90\x80\x80");
+    EXPECT_EQ(value.serialize(), "{\"a\":[1,2.5,-3],\"b\":\"x\\\"\xC3\xA9\xF0\x9F\x98\x80\xF0\x90\x80\x80\","
+                                 "\"c\":[1,\"t\",null],\"d\":{}}");
     tamsa::JsonValue id;
     ASSERT_TRUE(tamsa::JsonValue::parse("18446744073709551615", &id));
     EXPECT_EQ(id.serialize(), "18446744073709551615") << "numbers keep their text";

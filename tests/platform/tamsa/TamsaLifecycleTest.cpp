@@ -1,5 +1,5 @@
 // Ingest, durability, and the thread rules: Abort from another thread, handles used at once.
-#include "TamsaTestStore.h"
+#include "StoreFixture.h"
 
 #include <QJsonArray>
 #include <QJsonDocument>
@@ -8,18 +8,16 @@
 #include <atomic>
 #include <chrono>
 #include <csignal>
-#include <random>
+#include <fstream>
 #include <sys/wait.h>
 #include <thread>
 #include <unistd.h>
 
-using namespace tamsatest;
+using namespace storetest;
 
 namespace {
 
-using Ids = std::vector<uint64_t>;
-
-class TamsaLifecycleTest : public TamsaStoreFixture
+class TamsaLifecycleTest : public StoreFixture
 {
 protected:
     std::vector<ObjectSpec> manyObjects(uint64_t firstId, size_t count, bool withVectors)
@@ -149,84 +147,6 @@ TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
     EXPECT_EQ(unset, nullptr);
 }
 
-TEST_F(TamsaLifecycleTest, MutatedAnswersAndQueriesAreRefusedOrStoredNeverCrash)
-{
-    ObjectSpec person;
-    person.attributes = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5]})";
-    person.trajectory = {{0.1, 0.2}, {0.3, 0.4}};
-    person.body = randomUnitVector(1);
-    person.face = randomUnitVector(2);
-    ObjectSpec car;
-    car.id = 2;
-    car.type = "Vehicle";
-    car.plateCrop = "AB-12";
-    const std::string valid = answerJson({person, car});
-    std::mt19937 random(77);
-    const char alphabet[] = "{}[]\",:0123456789.eE-+ntrufalsxyzIDN\\u\x01";
-    int stored = 0;
-    for (int round = 0; round < 400; ++round) {
-        std::string text = valid;
-        const int edits = 1 + int(random() % 8);
-        for (int e = 0; e < edits; ++e) {
-            const size_t at = random() % text.size();
-            switch (random() % 3) {
-            case 0:
-                text[at] = alphabet[random() % (sizeof alphabet - 1)];
-                break;
-            case 1:
-                text.insert(at, 1, alphabet[random() % (sizeof alphabet - 1)]);
-                break;
-            default:
-                text.erase(at, 1 + random() % 20);
-            }
-        }
-        const int32_t result = putText(1 + round % 3, text);
-        EXPECT_TRUE(result >= 0 || result == TAMSA_E_BAD_JSON) << result;
-        stored += result > 0 ? result : 0;
-
-        QueryOptions options; // the same text as every query field
-        options.locations = {1, 2, 3};
-        const std::string fragment = text.substr(random() % text.size(), 40);
-        switch (round % 4) {
-        case 0:
-            options.primary = fragment;
-            break;
-        case 1:
-            options.trace = fragment;
-            break;
-        case 2:
-            options.feature = fragment;
-            break;
-        default:
-            options.plate = fragment;
-        }
-        int32_t status = 0;
-        search(options, &status);
-        EXPECT_TRUE(status == TAMSA_E_NO_MORE_RECORDS || status == TAMSA_E_BAD_QUERY) << status;
-    }
-    EXPECT_GT(stored, 0) << "some mutations leave valid objects";
-
-    // Control characters sent escaped stay text; they cannot pose as the store's vector markers.
-    ObjectSpec tricky;
-    tricky.id = 99;
-    tricky.body = randomUnitVector(99);
-    std::string answer = answerJson({tricky});
-    answer.replace(answer.find("aW1hZ2U"), 7, "\\u0001\\u0002");
-    ASSERT_EQ(putText(9, answer), 1);
-    QueryOptions options;
-    options.locations = {9};
-    const std::vector<ResultCopy> results = search(options);
-    ASSERT_EQ(results.size(), 1u);
-    const QJsonObject thumbnail = QJsonDocument::fromJson(QByteArray::fromStdString(results[0].thumbnails))
-                                      .object()
-                                      .value("Thumbnail")
-                                      .toArray()
-                                      .at(0)
-                                      .toObject();
-    EXPECT_TRUE(thumbnail.value("image").toString().startsWith(QString::fromUtf8("\x01\x02")));
-    EXPECT_EQ(thumbnail.value("feature").toArray().size(), 512);
-}
-
 TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
 {
     ObjectSpec object;
@@ -259,8 +179,27 @@ TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
     EXPECT_EQ(searchIds(options), (Ids{11, 12}));
     options.feature = jsonArray(randomUnitVector(12));
     EXPECT_EQ(searchIds(options), Ids{12}) << "the child's vector is on disk too";
+
+    // A writer killed half-way through a row leaves a torn tail in the vector files: the next
+    // ingest cuts it off and appends whole rows after the last whole one.
+    Tamsa_ReleaseDatabase(&m_database);
+    for (const char* file : {"/features/L1.body.f32", "/features/L1.body.rows"}) {
+        std::ofstream(storagePath() + file, std::ios::app | std::ios::binary) << "torn row";
+    }
+    m_database = openHandle();
+    object.id = 13;
+    object.body = randomUnitVector(13);
+    ASSERT_EQ(put(1, {object}), 1);
+    for (uint32_t id : {11, 12, 13}) {
+        options.feature = jsonArray(randomUnitVector(id));
+        const std::vector<ResultCopy> hits = search(options);
+        ASSERT_EQ(idsOf(hits), Ids{id});
+        EXPECT_GT(hits[0].score, 0.999f);
+    }
 }
 
+// Abort from another thread: a Next that starts after Abort returned never delivers a record, the
+// search ends with the abort code, and every later Next says so too.
 TEST_F(TamsaLifecycleTest, AbortFromAnotherThreadEndsTheSearch)
 {
     ASSERT_EQ(put(1, manyObjects(1, 3000, false)), 3000);
@@ -271,67 +210,62 @@ TEST_F(TamsaLifecycleTest, AbortFromAnotherThreadEndsTheSearch)
     ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &query, &search), TAMSA_OK);
 
     std::atomic<int> delivered{0};
-    std::atomic<bool> abortSent{false};
+    std::atomic<bool> abortCalled{false};
+    std::atomic<bool> abortReturned{false};
     int32_t endStatus = 0;
-    int afterAbort = 0;
+    int lateRecords = 0;
     std::thread reader([&]() {
         TTAMSA_OBJECTMETAINFO_RESULT record{};
         record.wSize = sizeof record;
-        while ((endStatus = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK) {
-            ++delivered;
-            if (abortSent) {
-                ++afterAbort;
+        for (;;) {
+            const bool afterAbort = abortReturned;
+            if ((endStatus = Tamsa_GetObjectMetaInfoNext(search, &record)) != TAMSA_OK) {
+                break;
             }
-            std::this_thread::sleep_for(std::chrono::microseconds(200)); // a slow consumer
+            lateRecords += afterAbort;
+            if (++delivered == 50) {
+                while (!abortCalled) { // the search must not run out before Abort is called
+                    std::this_thread::yield();
+                }
+            }
+            std::this_thread::sleep_for(std::chrono::microseconds(500)); // a slow consumer
         }
     });
     while (delivered < 50) {
         std::this_thread::yield();
     }
-    abortSent = true;
+    abortCalled = true;
     Tamsa_GetObjectMetaInfoAbort(search);
+    abortReturned = true;
     reader.join();
     EXPECT_EQ(endStatus, TAMSA_E_ABORTED);
-    EXPECT_LE(afterAbort, 1) << "that Next or the following one ends the search";
-    EXPECT_LT(delivered.load(), 3000);
+    EXPECT_EQ(lateRecords, 0) << "records delivered by a Next that started after Abort returned";
     TTAMSA_OBJECTMETAINFO_RESULT record{};
     record.wSize = sizeof record;
     EXPECT_EQ(Tamsa_GetObjectMetaInfoNext(search, &record), TAMSA_E_ABORTED) << "and stays ended";
     Tamsa_GetObjectMetaInfoClose(search);
-}
 
-TEST_F(TamsaLifecycleTest, AbortDuringAFeatureScan)
-{
-    for (uint32_t location = 1; location <= 4; ++location) {
+    // During a feature scan, Abort lands at some point of it (or just before it).
+    for (uint32_t location = 2; location <= 4; ++location) {
         ASSERT_EQ(put(location, manyObjects(location * 10000, 2000, true)), 2000);
     }
-    QueryOptions options;
-    options.locations = {1, 2, 3, 4};
-    options.feature = jsonArray(randomUnitVector(10005));
-    EXPECT_EQ(searchIds(options), Ids{10005});
-
-    std::vector<uint32_t> locations;
-    const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(options, &locations);
-    // Abort lands at some point of the scan (or just before it); the Next must report it.
+    options.locations = {2, 3, 4};
+    options.feature = jsonArray(randomUnitVector(20005));
+    EXPECT_EQ(searchIds(options), Ids{20005});
+    const TTAMSA_OBJECTMETAINFO_QUERY scan = makeQuery(options, &locations);
     for (int delayMicroseconds : {0, 100, 300, 1000}) {
-        void* search = nullptr;
-        ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &query, &search), TAMSA_OK);
+        ASSERT_EQ(Tamsa_GetObjectMetaInfoFirst(m_database, &scan, &search), TAMSA_OK);
         std::thread aborter([&]() {
             std::this_thread::sleep_for(std::chrono::microseconds(delayMicroseconds));
             Tamsa_GetObjectMetaInfoAbort(search);
         });
-        TTAMSA_OBJECTMETAINFO_RESULT record{};
-        record.wSize = sizeof record;
         int32_t status = TAMSA_OK;
-        int count = 0;
-        while ((status = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK && count < 10) {
+        for (int count = 0;
+             count < 10 && (status = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK;) {
             ++count;
         }
         aborter.join();
-        if (status != TAMSA_E_ABORTED) {
-            // The scan finished before Abort arrived: the next call must see it.
-            EXPECT_EQ(status, TAMSA_E_NO_MORE_RECORDS);
-        }
+        EXPECT_TRUE(status == TAMSA_E_ABORTED || status == TAMSA_E_NO_MORE_RECORDS) << status;
         EXPECT_EQ(Tamsa_GetObjectMetaInfoNext(search, &record), TAMSA_E_ABORTED);
         Tamsa_GetObjectMetaInfoClose(search);
     }
@@ -358,7 +292,7 @@ TEST_F(TamsaLifecycleTest, HandlesSearchAndIngestOnSeveralThreadsAtOnce)
             void* handle = openHandle();
             for (int round = 0; round < 15; ++round) {
                 int32_t status = 0;
-                std::vector<ResultCopy> results = search(t % 2 ? feature : plain, &status, handle);
+                std::vector<ResultCopy> results = searchStore(handle, t % 2 ? feature : plain, &status);
                 Ids ids;
                 for (const ResultCopy& result : results) {
                     ids.push_back(result.id);

@@ -1,6 +1,7 @@
 #pragma once
-// Test helpers for the store: a fixture that owns a storage folder and a database handle, builders
-// for camera answers and query records, and copies of result records.
+// The object-metadata store under test: a fixture that owns a storage folder and a database
+// handle, builders for camera answers and query records, and copies of result records. Shared by
+// the store's own tests and by searches that run against the real store.
 
 #include "Tamsa.h"
 
@@ -11,11 +12,12 @@
 #include <string>
 #include <vector>
 
-namespace tamsatest {
+namespace storetest {
 
 constexpr size_t kDim = 512;
+using Ids = std::vector<uint64_t>;
 
-// A unit vector drawn from `seed`; noisyCopy() mixes in noise of the given norm.
+// A unit vector drawn from `seed`; noisyCopy() adds a random direction scaled by `noise`.
 std::vector<float> randomUnitVector(uint32_t seed);
 std::vector<float> noisyCopy(const std::vector<float>& base, float noise, uint32_t seed);
 float plainCosine(const std::vector<float>& a, const std::vector<float>& b);
@@ -75,24 +77,32 @@ struct ResultCopy
 // Builds the record; it points into `options` and `locationsOut`, which must outlive it.
 TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QueryOptions& options, std::vector<uint32_t>* locationsOut);
 
-class TamsaStoreFixture : public ::testing::Test
+// A new handle on `directory`, or null; the caller releases it.
+void* openStore(const std::string& directory);
+
+// Runs a search to its end on `database`; *status gets the code that ended it (or First's
+// failure). Without `status`, anything but the normal end fails the test.
+std::vector<ResultCopy> searchStore(void* database, const QueryOptions& options, int32_t* status = nullptr);
+Ids idsOf(const std::vector<ResultCopy>& results);
+
+class StoreFixture : public ::testing::Test
 {
 protected:
     void SetUp() override;
     void TearDown() override;
 
     std::string storagePath() const;
-    // A new handle on the fixture's storage folder; the caller releases it.
-    void* openHandle() const;
+    void* openHandle() const { return openStore(storagePath()); }
     int32_t put(uint32_t location, const std::vector<ObjectSpec>& objects);
     int32_t putText(uint32_t location, const std::string& json);
-    // Runs a search to its end; *status gets the code that ended it (or the First failure).
-    std::vector<ResultCopy> search(const QueryOptions& options, int32_t* status = nullptr,
-                                   void* handle = nullptr);
-    std::vector<uint64_t> searchIds(const QueryOptions& options);
+    std::vector<ResultCopy> search(const QueryOptions& options, int32_t* status = nullptr)
+    {
+        return searchStore(m_database, options, status);
+    }
+    Ids searchIds(const QueryOptions& options) { return idsOf(search(options)); }
 
     QTemporaryDir m_dir;
     void* m_database = nullptr;
 };
 
-} // namespace tamsatest
+} // namespace storetest

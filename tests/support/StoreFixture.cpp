@@ -1,11 +1,11 @@
-#include "TamsaTestStore.h"
+#include "StoreFixture.h"
 
 #include <charconv>
 #include <cmath>
 #include <cstring>
 #include <random>
 
-namespace tamsatest {
+namespace storetest {
 
 std::vector<float> randomUnitVector(uint32_t seed)
 {
@@ -121,72 +121,33 @@ TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QueryOptions& options, std::vector<u
     return query;
 }
 
-void TamsaStoreFixture::SetUp()
+void* openStore(const std::string& directory)
 {
-    ASSERT_TRUE(m_dir.isValid());
-    m_database = openHandle();
-    ASSERT_NE(m_database, nullptr);
-}
-
-void TamsaStoreFixture::TearDown()
-{
-    Tamsa_ReleaseDatabase(&m_database);
-}
-
-std::string TamsaStoreFixture::storagePath() const
-{
-    return (m_dir.path() + QStringLiteral("/Server")).toStdString();
-}
-
-void* TamsaStoreFixture::openHandle() const
-{
-    unsigned char record[704] = {};
-    record[0] = 704 & 0xFF;
-    record[1] = 704 >> 8;
+    unsigned char record[704] = {704 & 0xFF, 704 >> 8};
     void* database = nullptr;
-    if (Tamsa_InitDatabase(&database, record, 0) != TAMSA_OK) {
-        return nullptr;
-    }
-    if (Tamsa_SetStoragesDBPath(database, storagePath().c_str()) != TAMSA_OK) {
+    if (Tamsa_InitDatabase(&database, record, 0) == TAMSA_OK &&
+        Tamsa_SetStoragesDBPath(database, directory.c_str()) != TAMSA_OK) {
         Tamsa_ReleaseDatabase(&database);
     }
     return database;
 }
 
-int32_t TamsaStoreFixture::put(uint32_t location, const std::vector<ObjectSpec>& objects)
-{
-    return putText(location, answerJson(objects));
-}
-
-int32_t TamsaStoreFixture::putText(uint32_t location, const std::string& json)
-{
-    return Tamsa_PutObjectMetaInfo(m_database, 7, int32_t(location), json.c_str());
-}
-
-std::vector<ResultCopy> TamsaStoreFixture::search(const QueryOptions& options, int32_t* status, void* handle)
+std::vector<ResultCopy> searchStore(void* database, const QueryOptions& options, int32_t* status)
 {
     std::vector<uint32_t> locations;
     const TTAMSA_OBJECTMETAINFO_QUERY query = makeQuery(options, &locations);
     void* search = nullptr;
     std::vector<ResultCopy> results;
-    int32_t code = Tamsa_GetObjectMetaInfoFirst(handle ? handle : m_database, &query, &search);
+    int32_t code = Tamsa_GetObjectMetaInfoFirst(database, &query, &search);
     if (code == TAMSA_OK) {
-        TTAMSA_OBJECTMETAINFO_RESULT record;
-        std::memset(&record, 0, sizeof record);
+        TTAMSA_OBJECTMETAINFO_RESULT record{};
         record.wSize = sizeof record;
         while ((code = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK) {
-            ResultCopy copy;
-            copy.id = record.qwObjectId;
-            copy.location = record.dwLocationNumber;
-            copy.type = record.pszObjectType;
-            copy.attributes = record.pszAttributes;
-            copy.start = record.dwStartTime;
-            copy.end = record.dwEndTime;
-            copy.trajectory.assign(record.pTrajectory, record.pTrajectory + record.dwTrajectoryBytes / 8);
-            copy.thumbnails = record.pszThumbnails;
-            copy.score = record.fScore;
-            copy.faceScore = record.fFaceScore;
-            results.push_back(copy);
+            results.push_back(
+                {record.qwObjectId, record.dwLocationNumber, record.pszObjectType, record.pszAttributes,
+                 record.dwStartTime, record.dwEndTime,
+                 std::vector<double>(record.pTrajectory, record.pTrajectory + record.dwTrajectoryBytes / 8),
+                 record.pszThumbnails, record.fScore, record.fFaceScore});
         }
         Tamsa_GetObjectMetaInfoClose(search);
     }
@@ -198,13 +159,40 @@ std::vector<ResultCopy> TamsaStoreFixture::search(const QueryOptions& options, i
     return results;
 }
 
-std::vector<uint64_t> TamsaStoreFixture::searchIds(const QueryOptions& options)
+Ids idsOf(const std::vector<ResultCopy>& results)
 {
-    std::vector<uint64_t> ids;
-    for (const ResultCopy& result : search(options)) {
+    Ids ids;
+    for (const ResultCopy& result : results) {
         ids.push_back(result.id);
     }
     return ids;
 }
 
-} // namespace tamsatest
+void StoreFixture::SetUp()
+{
+    ASSERT_TRUE(m_dir.isValid());
+    m_database = openHandle();
+    ASSERT_NE(m_database, nullptr);
+}
+
+void StoreFixture::TearDown()
+{
+    Tamsa_ReleaseDatabase(&m_database);
+}
+
+std::string StoreFixture::storagePath() const
+{
+    return (m_dir.path() + QStringLiteral("/Server")).toStdString();
+}
+
+int32_t StoreFixture::put(uint32_t location, const std::vector<ObjectSpec>& objects)
+{
+    return putText(location, answerJson(objects));
+}
+
+int32_t StoreFixture::putText(uint32_t location, const std::string& json)
+{
+    return Tamsa_PutObjectMetaInfo(m_database, 7, int32_t(location), json.c_str());
+}
+
+} // namespace storetest

@@ -30,11 +30,11 @@ struct ObjectSpec
     uint32_t start = 1000;
     uint32_t end = 1010;
     std::string attributes = "{}";
-    std::vector<std::pair<double, double>> trajectory;
-    std::vector<float> body;
-    std::vector<float> face;
+    std::vector<std::pair<double, double>> trajectory{};
+    std::vector<float> body{};
+    std::vector<float> face{};
     bool faceFiltered = false;
-    std::string plateCrop; // non-empty: a LicensePlateThumbnail with this PlateNumber
+    std::string plateCrop{}; // non-empty: a LicensePlateThumbnail with this PlateNumber
 };
 
 std::string objectJson(const ObjectSpec& object);

@@ -42,13 +42,8 @@ TEST_F(TamsaLifecycleTest, ReingestReplacesWithoutDuplicates)
 {
     const std::vector<float> oldVector = randomUnitVector(1);
     const std::vector<float> newVector = randomUnitVector(2);
-    ObjectSpec object;
-    object.id = 42;
-    object.attributes = R"({"Gender":0})";
-    object.body = oldVector;
-    ASSERT_EQ(put(1, {object}), 1);
-    object.attributes = R"({"Gender":1})";
-    object.body = newVector;
+    ASSERT_EQ(put(1, {{42, "Human", 1000, 1010, R"({"Gender":0})", {}, oldVector}}), 1);
+    const ObjectSpec object{42, "Human", 1000, 1010, R"({"Gender":1})", {}, newVector};
     ASSERT_EQ(put(1, {object}), 1);
     ASSERT_EQ(put(2, {object}), 1) << "the key is (location, ID)";
 
@@ -63,12 +58,8 @@ TEST_F(TamsaLifecycleTest, ReingestReplacesWithoutDuplicates)
     options.locations = {1, 2};
     EXPECT_EQ(search(options).size(), 2u);
 
-    ObjectSpec twice; // the same ID twice in one answer: the later one wins
-    twice.id = 7;
-    twice.attributes = R"({"Age":"Young"})";
-    ObjectSpec later = twice;
-    later.attributes = R"({"Age":"Old"})";
-    EXPECT_EQ(put(3, {twice, later}), 1);
+    // The same ID twice in one answer: the later one wins.
+    EXPECT_EQ(put(3, {{7, "Human", 1, 2, R"({"Age":"Young"})"}, {7, "Human", 1, 2, R"({"Age":"Old"})"}}), 1);
     options = QueryOptions();
     options.locations = {3};
     options.primary = R"({"Age":"Old"})";
@@ -85,11 +76,8 @@ TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
     // A text that is not UTF-8 makes the answer unreadable, as it would be to any reader of the texts
     // the store hands out: a stray continuation byte, a cut sequence, overlong forms, an encoded
     // surrogate, beyond U+10FFFF, bytes UTF-8 never uses, and a bad escape.
-    for (const char* text : {"\x97",
-                             "\xC7"
-                             "4",
-                             "\xE4\xBA", "\xC0\xAF", "\xE0\x80\xAF", "\xED\xA0\x80", "\xF4\x90\x80\x80",
-                             "\xF8\x88\x80\x80\x80", "\xFF", "\\u12", "\\q"}) {
+    for (const char* text : {"\x97", "\xC7 ", "\xE4\xBA", "\xC0\xAF", "\xE0\x80\xAF", "\xED\xA0\x80",
+                             "\xF4\x90\x80\x80", "\xF8\x88\x80\x80\x80", "\xFF", "\\u12", "\\q"}) {
         EXPECT_EQ(putText(1, std::string(R"({"ObjectMetaInfo":[{"ID":3,"ObjectType":"Human","StartTime":1,)"
                                          R"("EndTime":2,"Attributes":{"Age":")") +
                                  text + "\"}}]}"),
@@ -154,10 +142,10 @@ TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
 
 TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
 {
-    ObjectSpec object;
-    object.id = 11;
-    object.body = randomUnitVector(11);
-    ASSERT_EQ(put(1, {object}), 1);
+    const auto withVector = [](uint32_t id) {
+        return ObjectSpec{id, "Human", 1000, 1010, "{}", {}, randomUnitVector(id)};
+    };
+    ASSERT_EQ(put(1, {withVector(11)}), 1);
     Tamsa_ReleaseDatabase(&m_database);
 
     // A child process stores an object and is killed at once, without any clean-up.
@@ -165,11 +153,7 @@ TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
     ASSERT_GE(child, 0);
     if (child == 0) {
         void* database = openHandle();
-        ObjectSpec inChild;
-        inChild.id = 12;
-        inChild.body = randomUnitVector(12);
-        const int32_t stored = Tamsa_PutObjectMetaInfo(database, 1, 1, answerJson({inChild}).c_str());
-        if (stored == 1) {
+        if (Tamsa_PutObjectMetaInfo(database, 1, 1, answerJson({withVector(12)}).c_str()) == 1) {
             ::kill(::getpid(), SIGKILL);
         }
         ::_exit(3);
@@ -192,9 +176,7 @@ TEST_F(TamsaLifecycleTest, StoredObjectsSurviveReopeningAndAKilledProcess)
         std::ofstream(storagePath() + file, std::ios::app | std::ios::binary) << "torn row";
     }
     m_database = openHandle();
-    object.id = 13;
-    object.body = randomUnitVector(13);
-    ASSERT_EQ(put(1, {object}), 1);
+    ASSERT_EQ(put(1, {withVector(13)}), 1);
     for (uint32_t id : {11, 12, 13}) {
         options.feature = jsonArray(randomUnitVector(id));
         const std::vector<ResultCopy> hits = search(options);

@@ -1,5 +1,6 @@
-// Which objects a search returns, and in which order: one table over a few hand-made objects,
-// then the scores of feature searches and the result record itself.
+// Which objects a search returns, and in which order: one table over a few
+// hand-made objects, then the scores of feature searches and the result record
+// itself.
 #include "StoreFixture.h"
 
 #include <QJsonArray>
@@ -18,40 +19,20 @@ class TamsaMatchingTest : public StoreFixture
 
 TEST_F(TamsaMatchingTest, QueriesSelectAndOrderTheRightObjects)
 {
-    ObjectSpec walker; // crosses x = 0.5 from the positive side, through the zone between points
-    walker.start = 100;
-    walker.end = 200;
-    walker.attributes = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5],"Accessories":[]})";
-    walker.trajectory = {{0.1, 0.5}, {0.3, 0.5}, {0.9, 0.5}};
-    ObjectSpec returner; // a long stay, crossing x = 0.5 the other way above the zone
-    returner.id = 2;
-    returner.start = 5000;
-    returner.end = 9000;
-    returner.attributes = R"({"Gender":0})";
-    returner.trajectory = {{0.9, 0.7}, {0.2, 0.7}};
-    ObjectSpec car;
-    car.id = 3;
-    car.type = "Vehicle";
-    car.start = 300;
-    car.end = 310;
-    car.attributes = R"({"Type":3,"PlateNumber":"ABC-1234"})";
-    car.trajectory = {{0.1, 0.1}, {0.4, 0.9}};
-    ObjectSpec van; // plate known only from the plate crop; passes beyond the line's end
-    van.id = 4;
-    van.type = "Vehicle";
-    van.start = 400;
-    van.end = 410;
-    van.plateCrop = "xyz 999";
-    van.trajectory = {{0.1, 1.5}, {0.9, 1.5}};
-    ObjectSpec loiterer; // 11 points over 10 s, points 2..7 inside the zone: a stay of 5 s
-    loiterer.id = 5;
+    // The walker crosses x = 0.5 from the positive side, entering the zone only between points; the
+    // returner stays long and crosses the other way above the zone; the van's plate is known only
+    // from its plate crop, and it passes beyond the line's end.
+    const std::string adult = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5],"Accessories":[]})";
+    const ObjectSpec walker{1, "Human", 100, 200, adult, {{0.1, 0.5}, {0.3, 0.5}, {0.9, 0.5}}};
+    const ObjectSpec returner{2, "Human", 5000, 9000, R"({"Gender":0})", {{0.9, 0.7}, {0.2, 0.7}}};
+    const ObjectSpec car{
+        3, "Vehicle", 300, 310, R"({"Type":3,"PlateNumber":"ABC-1234"})", {{0.1, 0.1}, {0.4, 0.9}}};
+    const ObjectSpec van{4, "Vehicle", 400, 410, "{}", {{0.1, 1.5}, {0.9, 1.5}}, {}, {}, false, "xyz 999"};
+    ObjectSpec loiterer{5}; // 11 points over 10 s, points 2..7 inside the zone: a stay of 5 s
     for (int i = 0; i <= 10; ++i) {
         loiterer.trajectory.push_back({i >= 2 && i <= 7 ? 0.55 : 0.7, 0.5});
     }
-    ObjectSpec elsewhere;
-    elsewhere.id = 6;
-    elsewhere.start = 150;
-    elsewhere.end = 160;
+    const ObjectSpec elsewhere{6, "Human", 150, 160};
     ASSERT_EQ(put(1, {walker, returner, car, van, loiterer}), 5);
     ASSERT_EQ(put(3, {elsewhere}), 1);
 
@@ -145,22 +126,13 @@ TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
 {
     const std::vector<float> identity = randomUnitVector(1);
     const std::vector<float> faceIdentity = randomUnitVector(2);
-    ObjectSpec close;
-    close.body = noisyCopy(identity, 0.3f, 10);
-    ObjectSpec farther;
-    farther.id = 2;
-    farther.body = noisyCopy(identity, 1.0f, 11);
-    ObjectSpec stranger;
-    stranger.id = 3;
-    stranger.body = randomUnitVector(12);
-    stranger.face = randomUnitVector(13);
-    ObjectSpec faceOnly; // a stranger's body, the identity's face
-    faceOnly.id = 4;
-    faceOnly.body = randomUnitVector(14);
-    faceOnly.face = noisyCopy(faceIdentity, 0.2f, 15);
-    ObjectSpec vehicle;
-    vehicle.id = 5;
-    vehicle.type = "Vehicle";
+    const ObjectSpec close{1, "Human", 1000, 1010, "{}", {}, noisyCopy(identity, 0.3f, 10)};
+    const ObjectSpec farther{2, "Human", 1000, 1010, "{}", {}, noisyCopy(identity, 1.0f, 11)};
+    const ObjectSpec stranger{3, "Human", 1000, 1010, "{}", {}, randomUnitVector(12), randomUnitVector(13)};
+    // A stranger's body with the identity's face.
+    const ObjectSpec faceOnly{
+        4, "Human", 1000, 1010, "{}", {}, randomUnitVector(14), noisyCopy(faceIdentity, 0.2f, 15)};
+    const ObjectSpec vehicle{5, "Vehicle"};
     ASSERT_EQ(put(1, {close, farther, stranger, faceOnly, vehicle}), 5);
 
     QueryOptions options;
@@ -201,7 +173,7 @@ TEST_F(TamsaMatchingTest, ResultRecordCarriesEverythingStoredAndEndsCleanly)
 {
     ObjectSpec person;
     person.id = 18446744073709551615ull;
-    person.attributes = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5]})";
+    person.attributes = R"({"Age":"Adult","Gender":1,"UpperColor":[2,5],"Name":"\ud800\udc00 \u00e9"})";
     person.trajectory = {{0.25, 0.5}, {0.75, 0.125}};
     person.body = randomUnitVector(3);
     person.face = randomUnitVector(4);

@@ -19,9 +19,6 @@ using namespace Qt::StringLiterals;
 
 namespace {
 
-const QString kServerInfoId = u"3CE573D25E0F455B8F75EDDC573E2B64"_s;
-const QString kBookmarkId = u"2F6394EE90434A7190D7511370AFAE17"_s;
-
 class PathReceiver : public QObject
 {
     Q_OBJECT
@@ -33,25 +30,18 @@ public slots:
 
 } // namespace
 
-TEST(PluginHost, RefusesForeignModulesSayingWhy)
+TEST(PluginHost, LoadsThePluginDeliversRequestsOnRequestThreadsAndRefusesForeignModules)
 {
     QTemporaryDir data;
     PluginHost host(data.path());
-    const std::pair<QString, const char*> modules[] = {{WRONG_IID_MODULE_PATH, "interface id"},
-                                                       {WRONG_ID_MODULE_PATH, "PluginID"},
-                                                       {data.filePath(u"missing.so"_s), "not found"}};
-    for (const auto& [path, why] : modules) {
+    for (const auto& [path, why] : {std::pair{QString(WRONG_IID_MODULE_PATH), "interface id"},
+                                    {QString(WRONG_ID_MODULE_PATH), "PluginID"},
+                                    {data.filePath(u"no.so"_s), "not found"}}) {
         QString error;
         EXPECT_FALSE(host.load(path, &error));
         EXPECT_TRUE(error.contains(QLatin1String(why))) << qPrintable(error);
+        EXPECT_EQ(host.plugin(), nullptr);
     }
-    EXPECT_EQ(host.plugin(), nullptr);
-}
-
-TEST(PluginHost, LoadsThePluginAndDeliversRequestsOnRequestThreads)
-{
-    QTemporaryDir data;
-    PluginHost host(data.path());
     QString error;
     ASSERT_TRUE(host.load(PLUGIN_MODULE_PATH, &error)) << qPrintable(error);
     EXPECT_EQ(host.plugin()->thread(), QThread::currentThread());
@@ -61,21 +51,18 @@ TEST(PluginHost, LoadsThePluginAndDeliversRequestsOnRequestThreads)
     EXPECT_EQ(settings.value(u"Software/INSTALL_PATH"_s).toString(), QDir(data.path()).absolutePath());
 
     QMutex mutex;
-    QSet<QThread*> threads; // guarded by mutex
-    int replies = 0;        // guarded by mutex
+    QList<QThread*> threads; // guarded by mutex: one per reply
     for (int i = 0; i < 40; ++i) {
         host.request(u"noSuchCommand"_s, QVariant(i), RequestSenderInfo{},
                      [&](bool final, const QString& code, const QString&, const QVariant&) {
-                         EXPECT_TRUE(final);
-                         EXPECT_EQ(code, u"commandNotSupportError"_s);
+                         EXPECT_TRUE(final && code == u"commandNotSupportError"_s) << qPrintable(code);
                          QMutexLocker lock(&mutex);
-                         threads.insert(QThread::currentThread());
-                         ++replies;
+                         threads << QThread::currentThread();
                      });
     }
     host.waitForRequests();
     QMutexLocker lock(&mutex);
-    EXPECT_EQ(replies, 40);
+    EXPECT_EQ(threads.size(), 40);
     EXPECT_FALSE(threads.contains(QThread::currentThread()));
     lock.unlock();
     host.unload();
@@ -86,21 +73,22 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
 {
     QTemporaryDir data;
     QFile config(data.filePath(u"host.json"_s));
-    ASSERT_TRUE(config.open(QIODevice::WriteOnly));
-    config.write(R"({"remoteServers": ["", "east"]})");
+    ASSERT_TRUE(config.open(QIODevice::WriteOnly) && config.write(R"({"remoteServers": ["", "east"]})") > 0);
     config.close();
     std::atomic<int> answers{0}, stored{0}; // outlive the host, whose plug-ins answer on threads of their own
     PluginHost host(data.path());
 
-    PathReceiver receiver;
-    IPluginManager* manager = host.GetPluginManager();
-    EXPECT_NE(manager->GetPluginObject(kServerInfoId), nullptr);
-    EXPECT_EQ(manager->GetPluginObject(u"no-such-plugin"_s), nullptr);
+    const QString serverInfo = u"3CE573D25E0F455B8F75EDDC573E2B64"_s,
+                  bookmarks = u"2F6394EE90434A7190D7511370AFAE17"_s;
     const char* signal = "2serverDatabasePathChanged(const QString &)";
     const char* slot = "1onServerDatabasePathChanged(const QString &)";
-    EXPECT_TRUE(manager->ConnectPluginSignal(kServerInfoId, signal, &receiver, slot, 0));
+    PathReceiver receiver;
+    IPluginManager* manager = host.GetPluginManager();
+    EXPECT_NE(manager->GetPluginObject(serverInfo), nullptr);
+    EXPECT_EQ(manager->GetPluginObject(u"no-such-plugin"_s), nullptr);
+    EXPECT_TRUE(manager->ConnectPluginSignal(serverInfo, signal, &receiver, slot, 0));
     EXPECT_FALSE(manager->ConnectPluginSignal(u"no-such-plugin"_s, signal, &receiver, slot, 0));
-    EXPECT_FALSE(manager->ConnectPluginSignal(kServerInfoId, "2noSuchSignal()", &receiver, slot, 0));
+    EXPECT_FALSE(manager->ConnectPluginSignal(serverInfo, "2noSuchSignal()", &receiver, slot, 0));
     host.serverInfo().setServerDatabasePath(u"/elsewhere"_s);
     host.serverInfo().setServerDatabasePath(u"/elsewhere"_s); // unchanged: no signal
     EXPECT_EQ(receiver.paths, QStringList{u"/elsewhere"_s});
@@ -113,8 +101,8 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
     };
     const QVariantMap bookmark{{u"CameraID"_s, u"cam-1"_s}};
     IRelaySender* relay = host.GetRelaySender();
-    EXPECT_FALSE(relay->RelayRequest(kBookmarkId, u"AddBookmark"_s, bookmark, false, u"west"_s, answer));
-    EXPECT_TRUE(relay->RelayRequest(kBookmarkId, u"AddBookmark"_s, bookmark, false, u"east"_s, answer));
+    EXPECT_FALSE(relay->RelayRequest(bookmarks, u"AddBookmark"_s, bookmark, false, u"west"_s, answer));
+    EXPECT_TRUE(relay->RelayRequest(bookmarks, u"AddBookmark"_s, bookmark, false, u"east"_s, answer));
     ASSERT_TRUE(waitFor([&] { return answers > 0; }));
     EXPECT_EQ(stored, 1);
     EXPECT_EQ(host.remoteBookmarkPlugin(u"east"_s)->bookmarks().size(), 1);
@@ -128,32 +116,29 @@ TEST(DelvixHostProgram, CallPrintsOneJsonLinePerReplyAndRefusesBadUse)
     const QByteArray unsupported =
         R"({"final":true,"code":"commandNotSupportError","message":"","payload":null})"
         "\n";
-    struct Row
+    const struct
     {
         QStringList args;
-        bool ok;
-        QByteArray out;
+        QByteArray out; // empty: the program fails
         const char* err;
+    } rows[] = {
+        {call + QStringList{u"noSuchCommand"_s}, unsupported, ""},
+        {call + QStringList{u"Nope"_s, u"5"_s}, unsupported, ""}, // a bare number is a parameter
+        {call, {}, "usage"},
+        {call + QStringList{u"x"_s, u"{not json"_s}, {}, ""},
+        {call + QStringList{u"--module"_s, WRONG_ID_MODULE_PATH, u"x"_s}, {}, "PluginID"},
+        {{u"frobnicate"_s}, {}, ""},
+        {{u"call"_s, u"--bogus"_s, u"x"_s}, {}, ""},
     };
-    const Row rows[] = {
-        {call + QStringList{u"noSuchCommand"_s}, true, unsupported, ""},
-        {call + QStringList{u"Nope"_s, u"5"_s}, true, unsupported, ""}, // a bare number is a parameter
-        {call, false, {}, "usage"},
-        {call + QStringList{u"x"_s, u"{not json"_s}, false, {}, ""},
-        {call + QStringList{u"--module"_s, WRONG_ID_MODULE_PATH, u"x"_s}, false, {}, "PluginID"},
-        {{u"frobnicate"_s}, false, {}, ""},
-        {{u"call"_s, u"--bogus"_s, u"x"_s}, false, {}, ""},
-    };
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.args.join(u' ').toStdString());
+    for (const auto& row : rows) {
         QProcess process;
         process.start(DELVIX_HOST_PATH, row.args);
         ASSERT_TRUE(process.waitForFinished(scaledMs(30000)));
         const QByteArray err = process.readAllStandardError();
-        EXPECT_EQ(process.exitStatus(), QProcess::NormalExit);
-        EXPECT_EQ(process.exitCode() == 0, row.ok) << err.constData();
+        EXPECT_EQ(process.exitStatus() == QProcess::NormalExit && process.exitCode() == 0, !row.out.isEmpty())
+            << err.constData();
         EXPECT_EQ(process.readAllStandardOutput(), row.out);
-        EXPECT_TRUE(err.contains(row.err)) << err.constData();
+        EXPECT_TRUE(err.contains(row.err)) << qPrintable(row.args.join(u' ')) << err.constData();
     }
 }
 

@@ -1,17 +1,15 @@
 // The HTTP client against simulated cameras on loopback: every way a call can end, each completed
-// once on the owner thread; and what the cameras answer: the objects of a window, access tokens,
-// channels and their directory records.
+// once on the owner thread, and the objects a camera answers for a window. Fetching through access
+// tokens, TLS and channels end to end is the camera synchronisation's integration test.
 #include "BraskHttpClient.h"
 #include "CameraSimulator.h"
 #include "TestWait.h"
-#include "Zelto.h"
 
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
 #include <QTcpServer>
 #include <QThread>
-#include <QUrl>
 #include <QtEndian>
 #include <gtest/gtest.h>
 
@@ -231,36 +229,4 @@ TEST_F(HttpCamerasTest, AnswersHoldTheWindowsObjectsTheSameEachTimeWithTheIdenti
         }
         EXPECT_EQ(objects(fetch(client, camera, window(from + 60, from + 120))->body).size(), inMiddleMinute);
     }
-}
-
-TEST_F(HttpCamerasTest, ProtectedCameraAnswersAnAccessTokenAndChannelsAreCamerasOfTheirOwn)
-{
-    BraskHttpClient client;
-    const auto pair = fetch(client, "vault", u"/VCA/Secure/Token?method=GET&resource=/Data/DB/ObjMeta"_s);
-    ASSERT_EQ(pair->error, QNetworkReply::NoError);
-    EXPECT_EQ(m_cameras.issuedPairTokens("vault"), QStringList{QString::fromUtf8(pair->body)});
-    auto manager = Zelto::CreateProtectedAPIManager("", 0, true);
-    manager->SetPairToken(pair->body.constData(), size_t(pair->body.size()), true);
-    const QByteArray token = QUrl::toPercentEncoding(QString::fromStdString(manager->GetAccessToken()));
-    for (const char* camera : {"vault", "door"}) { // unprotected cameras take the token path as well
-        const auto granted = fetch(
-            client, camera,
-            u"/VCA/Data/DB/ObjMeta?accessToken=%1&StartTime=1000&EndTime=1060"_s.arg(QLatin1String(token)));
-        EXPECT_FALSE(objects(granted->body).isEmpty()) << camera;
-        EXPECT_TRUE(m_cameras.servedRequests().last().withAccessToken);
-    }
-
-    EXPECT_NE(fetch(client, "yard", window(1000, 1060, u"/VCA/c0"_s))->body,
-              fetch(client, "yard", window(1000, 1060, u"/VCA/c1"_s))->body);
-    const QVariantMap directory = m_cameras.directoryMap();
-    EXPECT_EQ(directory.keys(),
-              (QStringList{"digest", "door", "hall", "tls", "vault", "yard-c0", "yard-c1"}));
-    const QVariantMap channel = directory["yard-c1"].toMap();
-    EXPECT_EQ(std::tuple(channel["MultiChannelID"].toString(), channel["Port"].toInt(),
-                         QByteArray::fromHex(channel["Password"].toByteArray())),
-              std::tuple(u"1"_s, int(m_cameras.port("yard")), QByteArray("admin")));
-    EXPECT_NE(channel["Location"], directory["yard-c0"].toMap()["Location"]);
-    EXPECT_TRUE(directory["vault"].toMap()["DelvixProtect"].toBool() &&
-                directory["tls"].toMap()["UseSSL"].toBool());
-    EXPECT_FALSE(directory["door"].toMap().contains("MultiChannelID"));
 }

@@ -211,7 +211,7 @@ TEST(Zelto, ForeignPairTokenOrSecretAndTamperedTokensAreRefused)
 }
 
 // The log library reads its settings once per process: the lines are written in a fresh one.
-TEST(WemloLogUtl, DISABLED_WritesLinesOfUnknownModulesWithoutAName)
+TEST(WemloLogUtl, DISABLED_WritesInAFreshProcess)
 {
     QTemporaryDir dir;
     const QByteArray path = dir.filePath(u"log.txt"_s).toLocal8Bit();
@@ -242,5 +242,5 @@ TEST(WemloLogUtl, DISABLED_WritesLinesOfUnknownModulesWithoutAName)
 
 TEST(WemloLogUtl, WritesLinesOfUnknownModulesWithoutAName)
 {
-    runDisabledTestInChild("WemloLogUtl.DISABLED_WritesLinesOfUnknownModulesWithoutAName");
+    runDisabledTestInChild("WemloLogUtl.DISABLED_WritesInAFreshProcess");
 }

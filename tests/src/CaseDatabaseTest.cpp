@@ -307,7 +307,7 @@ TEST_F(CaseDatabaseTest, ThreadsInstancesAndCopiesLoseNoWrite)
         EXPECT_FALSE(second.containCase(shared));
 
         constexpr int threadCount = 4;
-        constexpr int rounds = 25;
+        constexpr int rounds = 20;
         std::vector<std::vector<int>> caseIds(threadCount);
         std::vector<std::thread> threads;
         for (int t = 0; t < threadCount; ++t) {

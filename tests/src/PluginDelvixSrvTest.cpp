@@ -140,24 +140,20 @@ protected:
 
 TEST(PluginDelvixSrvDispatch, RefusalsAnswerOnceAndFinal)
 {
-    PluginDelvixSrv plugin; // not loaded: no case vault yet
-    const std::vector<std::pair<QString, QString>> refusals{
-        {QStringLiteral("noSuchCommand"), RC_COMMAND_NOT_SUPPORTED},
-        {QString(), RC_COMMAND_NOT_SUPPORTED},
-        {QStringLiteral("StartSearch"), RC_COMMAND_NOT_SUPPORTED},
-        {QStringLiteral("GETCASELIST"), RC_COMMAND_NOT_SUPPORTED},
-        {QStringLiteral("startSearch "), RC_COMMAND_NOT_SUPPORTED},
-        {QStringLiteral("%s%s%s%n"), RC_COMMAND_NOT_SUPPORTED}, // outside text is never a format
-        {CMD_ADD_CASE_WITH_ITEM, RC_FAILURE},
-        {CMD_ADD_CASE_ITEM, RC_FAILURE},
-        {CMD_ADD_CASE_WITH_RECORDINGS, RC_FAILURE},
-        {CMD_ADD_CASE_ITEM_FROM_RECORDINGS, RC_FAILURE},
-        {CMD_UPDATE_CASE, RC_FAILURE},
-        {CMD_DELETE_CASE, RC_FAILURE},
-        {CMD_GET_CASE_LIST, RC_FAILURE},
-        {CMD_RETRIEVE_CASE_MODEL, RC_FAILURE},
-        {CMD_RETRIEVE_CASE_ITEM_MODEL, RC_FAILURE}};
-    for (const auto& [command, code] : refusals) {
+    PluginDelvixSrv plugin;
+    // Outside text is never a format; a case command before AllPluginLoaded has no vault.
+    QMap<QString, QString> refusals;
+    for (const char* command :
+         {"noSuchCommand", "", "StartSearch", "GETCASELIST", "startSearch ", "%s%s%s%n"}) {
+        refusals.insert(QString::fromLatin1(command), RC_COMMAND_NOT_SUPPORTED);
+    }
+    for (const QString& command :
+         {CMD_ADD_CASE_WITH_ITEM, CMD_ADD_CASE_ITEM, CMD_ADD_CASE_WITH_RECORDINGS,
+          CMD_ADD_CASE_ITEM_FROM_RECORDINGS, CMD_UPDATE_CASE, CMD_DELETE_CASE, CMD_GET_CASE_LIST,
+          CMD_RETRIEVE_CASE_MODEL, CMD_RETRIEVE_CASE_ITEM_MODEL}) {
+        refusals.insert(command, RC_FAILURE);
+    }
+    for (const auto& [command, code] : refusals.asKeyValueRange()) {
         ReplyRecorder recorder;
         plugin.Request(command, QVariantMap{{QStringLiteral("a"), 1}}, RequestSenderInfo{},
                        recorder.callback());

@@ -164,6 +164,10 @@ TEST_F(CaseDatabaseTest, WritesAreWhatAFreshInstanceReadsBack)
     raw("INSERT INTO \"Case\" (name, createdTime) VALUES ('Outside', 1)");
     EXPECT_FALSE(vault.containCase(other + 1));
     EXPECT_TRUE(fresh().containCase(other + 1));
+    // Nothing holds the file between operations.
+    for (const QString& name : QSqlDatabase::connectionNames()) {
+        EXPECT_FALSE(QSqlDatabase::database(name, false).isOpen()) << qPrintable(name);
+    }
 }
 
 TEST_F(CaseDatabaseTest, ReadModelsOrderDurationsAndCovers)

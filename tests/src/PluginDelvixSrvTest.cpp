@@ -439,8 +439,11 @@ TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
         thread.join();
     }
     // Every case is acknowledged once and is in one of the two vaults, with its item.
+    ASSERT_TRUE(waitFor([&] {
+        return std::all_of(recorders.begin(), recorders.end(),
+                           [](const ReplyRecorder& r) { return r.finalCount(); });
+    }));
     for (ReplyRecorder& recorder : recorders) {
-        ASSERT_TRUE(recorder.waitFinal());
         EXPECT_EQ(recorder.finalCount(), 1);
         EXPECT_EQ(recorder.last().code, RC_SUCCESS);
     }

@@ -1,161 +1,525 @@
-// Request dispatch of the plug-in object: refusals, the blocking entry points, traces, and
-// replies from concurrent request threads.
+// The plug-in object: request dispatch, its lifecycle around the case vault, and the case commands,
+// add batches and bookmarks against the host's real bookmark plug-ins (own threads), relay and
+// server-information plug-in, with case vaults in temporary folders.
 
 #include "PluginDelvixSrv.h"
+#include "BookmarkPlugin.h"
+#include "CaseDatabase.h"
 #include "DelvixKeys.h"
-#include "FakeWemlo.h"
-#include "LogFacility.h"
+#include "Faults.h"
+#include "HostFakes.h"
+#include "HostPluginManager.h"
+#include "HostRelaySender.h"
+#include "PluginServerInfo.h"
+#include "ReplyRecorder.h"
 
-#include <QMutex>
-#include <QThread>
+#include <QDir>
+#include <QFileInfo>
+#include <QTemporaryDir>
 #include <gtest/gtest.h>
+#include <memory>
 #include <thread>
 #include <vector>
 
 namespace {
 
-struct Reply
+// A bookmark plug-in that keeps the callbacks and answers only when the test does.
+class HoldingBookmarkPlugin : public QObject
 {
-    bool bFinal = false;
-    QString strCode;
-    QString strMessage;
-    QVariant payload;
+    Q_OBJECT
+public:
+    QList<HDLR_DO_REQUEST_CB> callbacks;
+    Q_INVOKABLE void AddBookmark(const QVariant&, const RequestSenderInfo&,
+                                 const HDLR_DO_REQUEST_CB& callback)
+    {
+        callbacks.append(callback);
+    }
 };
 
-// Collects replies from any thread.
-class ReplyRecorder
+// Fails the item updates of the ids it is given.
+class FailingUpdateDatabase : public CaseDatabase
 {
 public:
-    HDLR_DO_REQUEST_CB callback()
+    FailingUpdateDatabase(const QString& path, QSet<int> failing)
+        : CaseDatabase(path)
+        , m_failing(std::move(failing))
+    {}
+    bool updateCaseItem(int itemId, const QVariantMap& fields) override
     {
-        return
-            [this](bool bFinal, const QString& strCode, const QString& strMessage, const QVariant& payload) {
-                QMutexLocker lock(&m_mutex);
-                m_replies.push_back({bFinal, strCode, strMessage, payload});
-            };
-    }
-    std::vector<Reply> replies()
-    {
-        QMutexLocker lock(&m_mutex);
-        return m_replies;
+        return !m_failing.contains(itemId) && CaseDatabase::updateCaseItem(itemId, fields);
     }
 
 private:
-    QMutex m_mutex;
-    std::vector<Reply> m_replies; // guarded by m_mutex
+    QSet<int> m_failing;
 };
 
-// A responser that fails the test when anything is written to it.
-class StrictResponser : public IResponser
+QVariantMap item(const QString& nodeId, bool needBookmark, qint64 start = 1700000000000)
 {
-public:
-    void Respond(const QString&, const QString&, const QVariant&) override
-    {
-        ADD_FAILURE() << "the responser must not be used";
-    }
-};
-
-void expectOneRefusal(PluginDelvixSrv& plugin, const QString& strCommand)
-{
-    ReplyRecorder recorder;
-    plugin.Request(strCommand, QVariantMap{{QStringLiteral("a"), 1}}, RequestSenderInfo{},
-                   recorder.callback());
-    const std::vector<Reply> replies = recorder.replies();
-    ASSERT_EQ(replies.size(), 1u) << qPrintable(strCommand);
-    EXPECT_TRUE(replies[0].bFinal);
-    EXPECT_EQ(replies[0].strCode, QStringLiteral("commandNotSupportError"));
-    EXPECT_TRUE(replies[0].strMessage.isEmpty());
-    EXPECT_FALSE(replies[0].payload.isValid());
+    return {{KEY_NODE_ID, nodeId},
+            {KEY_LOC_ID, QStringLiteral("Loc3")},
+            {KEY_START_TIMESTAMP, start},
+            {KEY_END_TIMESTAMP, start + 60000},
+            {KEY_CASE_ITEM_TYPE, 0},
+            {KEY_OBJ_IMAGE, QStringLiteral("aW1n")},
+            {KEY_NEED_BOOKMARK, needBookmark}};
 }
+
+QVariantMap batch(const QString& name, const QVariantList& items)
+{
+    return {{KEY_CASE_NAME, name}, {KEY_CASE_ITEM, items}};
+}
+
+int caseIdOf(const Reply& reply)
+{
+    return reply.payload.toMap().value(KEY_CASE_ID).toInt();
+}
+
+class PluginCasesTest : public ::testing::Test
+{
+protected:
+    void SetUp() override
+    {
+        ASSERT_TRUE(m_dir.isValid());
+        // The server's database folders exist; the vault makes only its own folder inside.
+        for (const char* folder : {"db", "db2", "db3"}) {
+            QDir(m_dir.path()).mkpath(QLatin1String(folder));
+        }
+        m_serverInfo = std::make_unique<PluginServerInfo>(path("db"));
+        m_bookmarks = std::make_unique<BookmarkPlugin>(m_dir.filePath(QStringLiteral("bookmarks.json")));
+        m_remoteBookmarks = std::make_unique<BookmarkPlugin>(m_dir.filePath(QStringLiteral("remote.json")));
+        m_manager.registerPluginObject(PLUGIN_ID_SERVER_INFO, m_serverInfo.get());
+        m_manager.registerPluginObject(PLUGIN_ID_BOOKMARK, m_bookmarks.get());
+        m_remoteManager.registerPluginObject(PLUGIN_ID_BOOKMARK, m_remoteBookmarks.get());
+        m_relay.addRemoteServer(QStringLiteral("east"), &m_remoteManager);
+        m_plugin = std::make_unique<PluginDelvixSrv>();
+        m_plugin->InitialPluginBase(&m_tools);
+        m_plugin->AllPluginLoaded();
+    }
+
+    QString path(const char* folder) const { return m_dir.filePath(QLatin1String(folder)); }
+
+    // Sends one request from this thread and waits for its final reply.
+    ReplyRecorder& send(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
+    {
+        m_recorders.push_back(std::make_unique<ReplyRecorder>());
+        ReplyRecorder& recorder = *m_recorders.back();
+        (plugin ? plugin : m_plugin.get())->Request(command, params, m_sender, recorder.callback());
+        recorder.waitFinal();
+        return recorder;
+    }
+    Reply call(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
+    {
+        ReplyRecorder& recorder = send(command, params, plugin);
+        EXPECT_EQ(recorder.finalCount(), 1) << qPrintable(command);
+        return recorder.last();
+    }
+    QStringList caseNames(PluginDelvixSrv* plugin = nullptr)
+    {
+        QStringList names;
+        for (const QVariant& element : call(CMD_GET_CASE_LIST, QVariant(), plugin).payload.toList()) {
+            names << element.toMap().value(KEY_CASE_NAME).toString();
+        }
+        return names;
+    }
+    CaseDatabase vault(const char* folder = "db") const { return CaseDatabase(path(folder)); }
+
+    QTemporaryDir m_dir;
+    std::unique_ptr<PluginServerInfo> m_serverInfo;
+    std::unique_ptr<BookmarkPlugin> m_bookmarks;
+    std::unique_ptr<BookmarkPlugin> m_remoteBookmarks;
+    HostPluginManager m_manager;
+    HostPluginManager m_remoteManager;
+    HostRelaySender m_relay;
+    TestTools m_tools{&m_manager, nullptr, &m_relay};
+    std::unique_ptr<PluginDelvixSrv> m_plugin;
+    RequestSenderInfo m_sender;
+    std::vector<std::unique_ptr<ReplyRecorder>> m_recorders;
+};
 
 } // namespace
 
-TEST(PluginDelvixSrvDispatch, UnknownEmptyAndMiscasedCommandsAreRefusedOnce)
+TEST(PluginDelvixSrvDispatch, RefusalsAnswerOnceAndFinal)
 {
     PluginDelvixSrv plugin;
-    expectOneRefusal(plugin, QStringLiteral("noSuchCommand"));
-    expectOneRefusal(plugin, QString());
-    expectOneRefusal(plugin, QStringLiteral("StartSearch"));
-    expectOneRefusal(plugin, QStringLiteral("GETCASELIST"));
-    expectOneRefusal(plugin, QStringLiteral("startSearch "));
-    // Text from outside never becomes a format.
-    expectOneRefusal(plugin, QStringLiteral("%s%s%s%n"));
-}
-
-TEST(PluginDelvixSrvDispatch, BlockingEntryPointsNeverTouchTheResponser)
-{
-    PluginDelvixSrv plugin;
-    StrictResponser responser;
-    plugin.RequestBlock(CMD_GET_CASE_LIST, QVariant(), RequestSenderInfo{}, responser);
-    plugin.SubscribeEventBlock(QStringLiteral("event"), QStringLiteral("filter"), QVariant(),
-                               RequestSenderInfo{}, responser);
-    plugin.UnsubscribeEventBlock(QStringLiteral("event"), QVariant(), responser);
-}
-
-TEST(PluginDelvixSrvDispatch, EntryPointsAreTracedInPairs)
-{
-    fakeWemloReset();
-    LogFacility::reload(FAKE_WEMLO_PATH);
-    {
-        PluginDelvixSrv plugin;
-        StrictResponser responser;
+    // Outside text is never a format; a case command before AllPluginLoaded has no vault.
+    QMap<QString, QString> refusals;
+    for (const char* command :
+         {"noSuchCommand", "", "StartSearch", "GETCASELIST", "startSearch ", "%s%s%s%n"}) {
+        refusals.insert(QString::fromLatin1(command), RC_COMMAND_NOT_SUPPORTED);
+    }
+    for (const QString& command :
+         {CMD_ADD_CASE_WITH_ITEM, CMD_ADD_CASE_ITEM, CMD_ADD_CASE_WITH_RECORDINGS,
+          CMD_ADD_CASE_ITEM_FROM_RECORDINGS, CMD_UPDATE_CASE, CMD_DELETE_CASE, CMD_GET_CASE_LIST,
+          CMD_RETRIEVE_CASE_MODEL, CMD_RETRIEVE_CASE_ITEM_MODEL}) {
+        refusals.insert(command, RC_FAILURE);
+    }
+    for (const auto& [command, code] : refusals.asKeyValueRange()) {
         ReplyRecorder recorder;
-        plugin.Request(QStringLiteral("nope"), QVariant(), RequestSenderInfo{}, recorder.callback());
-        plugin.RequestBlock(QString(), QVariant(), RequestSenderInfo{}, responser);
-        plugin.SubscribeEventBlock(QString(), QString(), QVariant(), RequestSenderInfo{}, responser);
-        plugin.UnsubscribeEventBlock(QString(), QVariant(), responser);
+        plugin.Request(command, QVariantMap{{QStringLiteral("a"), 1}}, RequestSenderInfo{},
+                       recorder.callback());
+        ASSERT_EQ(recorder.replies().size(), 1u) << qPrintable(command);
+        EXPECT_TRUE(recorder.last().final);
+        EXPECT_EQ(recorder.last().code, code) << qPrintable(command);
+        EXPECT_TRUE(recorder.last().message.isEmpty());
+        EXPECT_FALSE(recorder.last().payload.isValid());
     }
-    std::vector<std::string> texts;
-    for (const FakeWemloLine& line : fakeWemloState().lines) {
-        texts.push_back(line.text);
-    }
-    EXPECT_EQ(texts, (std::vector<std::string>{
-                         "PluginDelvixSrv::Request, Enter",
-                         "PluginDelvixSrv::Request, Leave",
-                         "PluginDelvixSrv::RequestBlock, Enter",
-                         "PluginDelvixSrv::RequestBlock, Leave",
-                         "PluginDelvixSrv::SubscribeEventBlock, Enter",
-                         "PluginDelvixSrv::SubscribeEventBlock, Leave",
-                         "PluginDelvixSrv::UnsubscribeEventBlock, Enter",
-                         "PluginDelvixSrv::UnsubscribeEventBlock, Leave",
-                         "PluginDelvixSrv::~PluginDelvixSrv, Enter",
-                         "PluginDelvixSrv::~PluginDelvixSrv, Leave",
-                     }));
-    fakeWemloReset();
 }
 
-TEST(PluginDelvixSrvDispatch, ConcurrentRequestsEachGetTheirOwnReply)
+TEST_F(PluginCasesTest, VaultFollowsTheServerPathUnlessOneWasInstalled)
 {
-    PluginDelvixSrv plugin;
-    constexpr int kThreads = 8;
-    constexpr int kRequestsPerThread = 200;
-    std::vector<ReplyRecorder> recorders(kThreads);
+    ASSERT_EQ(call(CMD_ADD_CASE_WITH_ITEM,
+                   QVariantMap{{KEY_CASE_NAME, "in db"}, {KEY_CASE_ITEM, item("c1", false)}})
+                  .code,
+              RC_SUCCESS);
+    vault("db3").addCase(QStringLiteral("in db3"), QStringLiteral("1"), QString());
+    // Two changes in a row: the second path's vault is the one in use.
+    m_serverInfo->setServerDatabasePath(path("db2"));
+    m_serverInfo->setServerDatabasePath(path("db3"));
+    EXPECT_EQ(caseNames(), QStringList{"in db3"});
+    EXPECT_EQ(vault("db").getAllCase().value(0).toMap().value(KEY_CASE_NAME), "in db");
+
+    // A vault installed before AllPluginLoaded stays.
+    m_serverInfo->setServerDatabasePath(path("db"));
+    PluginDelvixSrv installed;
+    installed.setCaseDatabase(std::make_shared<CaseDatabase>(path("db3")));
+    installed.InitialPluginBase(&m_tools);
+    installed.AllPluginLoaded();
+    EXPECT_EQ(caseNames(&installed), QStringList{"in db3"});
+
+    // Without the server-information plug-in there is no path: no file anywhere, and failures.
+    const bool rootFolderBefore = QFileInfo::exists(QStringLiteral("/PluginDelvix"));
+    HostPluginManager empty;
+    TestTools tools(&empty);
+    PluginDelvixSrv pathless;
+    pathless.InitialPluginBase(&tools);
+    pathless.AllPluginLoaded();
+    EXPECT_EQ(call(CMD_ADD_CASE_WITH_ITEM, batch("x", {}), &pathless).code, RC_FAILURE);
+    EXPECT_EQ(QFileInfo::exists(QStringLiteral("/PluginDelvix")), rootFolderBefore);
+
+    // Settings reached by name: without "enable" searches are off and answered at once.
+    ASSERT_TRUE(QMetaObject::invokeMethod(&pathless, "setEnableDelvix", Qt::DirectConnection,
+                                          Q_ARG(QVariantMap, QVariantMap{})));
+    ReplyRecorder& search = send(CMD_START_SEARCH, QVariantMap{}, &pathless);
+    ASSERT_EQ(search.replies().size(), 1u);
+    EXPECT_EQ(search.last().code, RC_SUCCESS);
+    EXPECT_FALSE(search.last().payload.isValid());
+}
+
+TEST_F(PluginCasesTest, BookmarksGoWhereTheNodeLives)
+{
+    for (const auto& [node, relay, camera] :
+         std::vector<std::tuple<QString, QString, QString>>{{"cam1", "", "cam1"},
+                                                            {"east/cam1", "east", "cam1"},
+                                                            {"a/b/c", "a", "b"},
+                                                            {"/cam", "", "cam"},
+                                                            {"east/", "east", ""}}) {
+        EXPECT_EQ(PluginDelvixSrv::getRelayPath(node), relay) << qPrintable(node);
+        EXPECT_EQ(PluginDelvixSrv::getCameraId(node), camera) << qPrintable(node);
+    }
+
+    // Remote answers are mapped; an unknown relay path is refused at once.
+    const QVariantMap request{{KEY_BM_CAMERA_ID, QStringLiteral("cam7")}};
+    ReplyRecorder ok, failed, unknown, local;
+    m_plugin->addSubstationBookmark(request, QStringLiteral("east"), ok.callback());
+    ASSERT_TRUE(ok.waitFinal());
+    EXPECT_EQ(ok.last().code, RC_SUCCESS);
+    const QString remoteId = ok.last().payload.toMap().value(KEY_BM_BOOKMARK_ID).toString();
+    EXPECT_TRUE(m_remoteBookmarks->bookmarks().contains(remoteId));
+    m_remoteBookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Fail);
+    m_plugin->addSubstationBookmark(request, QStringLiteral("east"), failed.callback());
+    ASSERT_TRUE(failed.waitFinal());
+    EXPECT_EQ(failed.last().code, RC_FAILURE);
+    EXPECT_FALSE(failed.last().payload.isValid());
+    m_remoteBookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Normal);
+    m_plugin->addSubstationBookmark(request, QStringLiteral("west"), unknown.callback());
+    ASSERT_EQ(unknown.replies().size(), 1u);
+    EXPECT_EQ(unknown.last().code, RC_FAILURE);
+
+    // Deleted items take their bookmarks along, each where it lives.
+    m_plugin->addBookmark(QVariantMap{{KEY_BM_CAMERA_ID, QStringLiteral("c1")}}, m_sender, local.callback());
+    ASSERT_TRUE(local.waitFinal());
+    const QString localId = local.last().payload.toMap().value(KEY_BM_BOOKMARK_ID).toString();
+    const int requestsBefore = m_bookmarks->requestCount();
+    QVariantMap emptyBookmark = item(QStringLiteral("c3"), false);
+    emptyBookmark.insert(KEY_BOOKMARK_ID, QString());
+    QVariantMap localItem = item(QStringLiteral("c1"), false);
+    localItem.insert(KEY_BOOKMARK_ID, localId);
+    QVariantMap remoteItem = item(QStringLiteral("east/c2"), false);
+    remoteItem.insert(KEY_BOOKMARK_ID, remoteId);
+    m_plugin->handleDeleteCaseItemBookmark(
+        {item(QStringLiteral("c3"), false), emptyBookmark, localItem, remoteItem}, m_sender);
+    ASSERT_TRUE(waitFor(
+        [&] { return m_bookmarks->bookmarks().isEmpty() && m_remoteBookmarks->bookmarks().isEmpty(); }));
+    EXPECT_EQ(m_bookmarks->requestCount(), requestsBefore + 1);
+
+    // Without a bookmark plug-in, adding answers failure once.
+    HostPluginManager none;
+    TestTools tools(&none, nullptr, &m_relay);
+    PluginDelvixSrv bare;
+    bare.InitialPluginBase(&tools);
+    ReplyRecorder added;
+    bare.addBookmark(request, m_sender, added.callback());
+    ASSERT_EQ(added.replies().size(), 1u);
+    EXPECT_TRUE(added.last().final);
+    EXPECT_EQ(added.last().code, RC_FAILURE);
+}
+
+TEST_F(PluginCasesTest, AddBatchesStoreWhatWasBookmarked)
+{
+    // Without bookmarks: one progress reply per item, then the case.
+    ReplyRecorder& plain = send(CMD_ADD_CASE_WITH_RECORDINGS,
+                                batch("Robbery", {item("c1", false, 1000), item("c2", false, 2000)}));
+    const std::vector<Reply> replies = plain.replies();
+    ASSERT_EQ(replies.size(), 3u);
+    for (int i = 0; i < 2; ++i) {
+        EXPECT_FALSE(replies[i].final);
+        EXPECT_EQ(replies[i].code, RC_SUCCESS);
+    }
+    EXPECT_EQ(replies[2].code, RC_SUCCESS);
+    EXPECT_EQ(replies[2].payload.toMap().value(KEY_CASE_NAME), "Robbery");
+    EXPECT_EQ(vault().getCaseItemList(caseIdOf(replies[2])).size(), 2);
+
+    // Bookmarks are made here and through the relay; an item keeps a bookmark id of its own.
+    QVariantMap own = item(QStringLiteral("c1"), true, 1000);
+    own.insert(KEY_BOOKMARK_ID, QStringLiteral("mine"));
+    const Reply marked =
+        call(CMD_ADD_CASE_WITH_RECORDINGS, batch("marked", {own, item("east/c2", true, 2000)}));
+    ASSERT_EQ(marked.code, RC_SUCCESS);
+    QStringList stored;
+    for (const QVariant& element : vault().getCaseItemList(caseIdOf(marked))) {
+        stored << element.toMap().value(KEY_BOOKMARK_ID).toString();
+    }
+    EXPECT_EQ(m_bookmarks->bookmarks().size(), 1); // made, though the item kept its own id
+    ASSERT_EQ(m_remoteBookmarks->bookmarks().size(), 1);
+    EXPECT_EQ(QSet<QString>(stored.begin(), stored.end()),
+              (QSet<QString>{"mine", m_remoteBookmarks->bookmarks().keys().first()}));
+    const QVariantMap made = m_remoteBookmarks->bookmarks().values().first();
+    EXPECT_EQ(made.value(KEY_BM_CAMERA_ID), "c2");
+    EXPECT_EQ(made.value(KEY_BM_CREATOR), "admin");
+    EXPECT_EQ(made.value(KEY_BM_GROUP), "CaseVault");
+    EXPECT_EQ(made.value(KEY_BM_LOCATION_ID), "Loc3");
+
+    // A failed bookmark leaves its item out and ends the batch with failure.
+    m_bookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Fail);
+    ReplyRecorder& failed = send(CMD_ADD_CASE_WITH_ITEM,
+                                 QVariantMap{{KEY_CASE_NAME, "failed"}, {KEY_CASE_ITEM, item("c1", true)}});
+    ASSERT_EQ(failed.replies().size(), 2u);
+    EXPECT_EQ(failed.last().code, RC_FAILURE);
+    EXPECT_FALSE(failed.last().payload.isValid());
+    const QVariantList cases = vault().getAllCase();
+    ASSERT_EQ(cases.size(), 3);
+    EXPECT_TRUE(vault().getCaseItemList(cases[2].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
+}
+
+TEST_F(PluginCasesTest, BatchesAreAnsweredOnceWhateverTheBookmarkPluginDoes)
+{
+    HoldingBookmarkPlugin holding;
+    m_manager.registerPluginObject(PLUGIN_ID_BOOKMARK, &holding);
+    // An empty batch asks nothing and answers nothing; its case stays.
+    ReplyRecorder empty;
+    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("kept", {}), m_sender, empty.callback());
+    EXPECT_EQ(caseNames(), QStringList{"kept"}); // a later request's answer came first
+    EXPECT_TRUE(empty.replies().empty());
+
+    // Double answers count once.
+    ReplyRecorder twice;
+    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("twice", {item("c1", true), item("c2", true)}),
+                      m_sender, twice.callback());
+    ASSERT_EQ(holding.callbacks.size(), 2);
+    const QVariantMap bookmark{{KEY_BM_BOOKMARK_ID, QStringLiteral("b1")}};
+    holding.callbacks[0](true, RC_SUCCESS, QString(), bookmark);
+    holding.callbacks[0](true, RC_SUCCESS, QString(), bookmark);
+    EXPECT_EQ(twice.replies().size(), 1u);
+    holding.callbacks[1](true, RC_SUCCESS, QString(), bookmark);
+    ASSERT_TRUE(twice.waitFinal());
+    holding.callbacks[1](true, RC_SUCCESS, QString(), bookmark);
+    QCoreApplication::processEvents();
+    EXPECT_EQ(twice.replies().size(), 3u);
+    EXPECT_EQ(twice.last().code, RC_SUCCESS);
+    EXPECT_EQ(vault().getCaseItemList(caseIdOf(twice.last())).size(), 2);
+
+    // The plug-in goes while a batch waits: the client gets its final answer then, and a late
+    // bookmark answer neither replies again nor writes anything.
+    ReplyRecorder waiting;
+    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("waiting", {item("c1", true), item("c2", true)}),
+                      m_sender, waiting.callback());
+    ASSERT_EQ(holding.callbacks.size(), 4);
+    holding.callbacks[2](true, RC_SUCCESS, QString(), bookmark);
+    ASSERT_EQ(waiting.replies().size(), 1u);
+    m_plugin.reset();
+    ASSERT_EQ(waiting.finalCount(), 1);
+    EXPECT_EQ(waiting.last().code, RC_FAILURE);
+    holding.callbacks[3](true, RC_SUCCESS, QString(), bookmark);
+    QCoreApplication::processEvents();
+    EXPECT_EQ(waiting.replies().size(), 2u);
+    const QVariantList cases = vault().getAllCase();
+    ASSERT_EQ(cases.size(), 3);
+    EXPECT_TRUE(vault().getCaseItemList(cases[2].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
+}
+
+TEST_F(PluginCasesTest, CaseCommandsGuardTheDataAndReadModelsShowIt)
+{
+    m_plugin->setCaseDatabase(std::make_shared<CaseDatabase>()); // a case that cannot be created
+    EXPECT_EQ(send(CMD_ADD_CASE_WITH_ITEM, QVariantMap{{KEY_CASE_ITEM, item("c", false)}}).replies().size(),
+              1u);
+    EXPECT_EQ(m_recorders.back()->last().code, RC_FAILURE);
+
+    auto failing = std::make_shared<FailingUpdateDatabase>(path("db"), QSet<int>{});
+    m_plugin->setCaseDatabase(failing);
+    const int caseId = caseIdOf(
+        call(CMD_ADD_CASE_WITH_RECORDINGS,
+             batch("c", {item("c1", false, 1000), item("c2", false, 2000), item("c3", false, 3000)})));
+    QList<int> ids = failing->getCaseItemIdSet(caseId).values();
+    std::sort(ids.begin(), ids.end());
+    ASSERT_EQ(ids.size(), 3);
+
+    const QVariantList model = call(CMD_RETRIEVE_CASE_MODEL, QVariant()).payload.toList();
+    ASSERT_EQ(model.size(), 1);
+    EXPECT_EQ(model[0].toMap().value(KEY_CASE_ID), caseId);
+    EXPECT_EQ(model[0].toMap().value(KEY_START_TIMESTAMP).toString().size(), 16); // "yyyy-MM-dd hh:mm"
+    EXPECT_EQ(model[0].toMap().value(KEY_COVER_IMAGE).toStringList(), (QStringList{"aW1n", "aW1n", "aW1n"}));
+    const QVariantMap itemModel = call(CMD_RETRIEVE_CASE_ITEM_MODEL, caseId).payload.toMap();
+    EXPECT_EQ(itemModel.value(KEY_CASE_INFO_MAP).toMap().value(KEY_CASE_ID), caseId);
+    EXPECT_EQ(itemModel.value(KEY_CASE_ITEM_LIST).toList().size(), 3);
+
+    EXPECT_EQ(call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, 9999}}).code, RC_CASE_NOT_FOUND);
+    const Reply missing = call(CMD_DELETE_CASE, 9999);
+    EXPECT_EQ(missing.code, RC_CASE_NOT_FOUND);
+    EXPECT_FALSE(missing.payload.isValid());
+    EXPECT_EQ(call(CMD_DELETE_CASE, QStringLiteral("not a number")).code, RC_CASE_NOT_FOUND);
+
+    // One failing item update: "-2", and that item goes with the one not listed.
+    auto failingOne = std::make_shared<FailingUpdateDatabase>(path("db"), QSet<int>{ids[1]});
+    m_plugin->setCaseDatabase(failingOne);
+    QVariantMap keep = item("c1", false, 1000);
+    keep.insert(KEY_ID, ids[0]);
+    keep.insert(KEY_COMMENT, QStringLiteral("kept"));
+    QVariantMap fail = item("c2", false, 2000);
+    fail.insert(KEY_ID, ids[1]);
+    const Reply updated = call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, caseId},
+                                                            {KEY_CASE_NAME, QStringLiteral("renamed")},
+                                                            {KEY_CASE_ITEM, QVariantList{keep, fail}}});
+    EXPECT_EQ(updated.code, RC_PARTIAL_FAILURE);
+    EXPECT_EQ(updated.payload.toMap().value(KEY_CASE_NAME), "renamed");
+    EXPECT_EQ(failingOne->getCaseItemIdSet(caseId), QSet<int>{ids[0]});
+    EXPECT_EQ(failingOne->getCaseItemInfoMap(ids[0]).value(KEY_COMMENT), "kept");
+
+    // An empty item list empties the case and still succeeds.
+    EXPECT_EQ(call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, caseId}}).code, RC_SUCCESS);
+    EXPECT_TRUE(vault().getCaseItemIdSet(caseId).isEmpty());
+    const Reply deleted = call(CMD_DELETE_CASE, caseId);
+    EXPECT_EQ(deleted.code, RC_SUCCESS);
+    EXPECT_EQ(deleted.payload.toInt(), caseId);
+    EXPECT_TRUE(caseNames().isEmpty());
+    EXPECT_TRUE(vault().getAllCase().isEmpty());
+}
+
+TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
+{
+    constexpr int kThreads = 4;
+    constexpr int kCasesPerThread = 15;
+    std::vector<ReplyRecorder> recorders(kThreads * kCasesPerThread);
     std::vector<std::thread> threads;
     for (int t = 0; t < kThreads; ++t) {
-        threads.emplace_back([&plugin, &recorders, t]() {
-            for (int i = 0; i < kRequestsPerThread; ++i) {
-                plugin.Request(QStringLiteral("unknown%1").arg(i), QVariant(i), RequestSenderInfo{},
-                               recorders[t].callback());
+        threads.emplace_back([&, t]() {
+            for (int i = 0; i < kCasesPerThread; ++i) {
+                const int n = t * kCasesPerThread + i;
+                m_plugin->Request(CMD_ADD_CASE_WITH_ITEM,
+                                  QVariantMap{{KEY_CASE_NAME, QStringLiteral("case %1").arg(n)},
+                                              {KEY_CASE_ITEM, item(QStringLiteral("c%1").arg(n), false)}},
+                                  m_sender, recorders[n].callback());
+                ReplyRecorder list;
+                m_plugin->Request(CMD_GET_CASE_LIST, QVariant(), m_sender, list.callback());
             }
         });
     }
+    // The path changes while the commands run; the host delivers the signal on this thread.
+    m_serverInfo->setServerDatabasePath(path("db2"));
     for (std::thread& thread : threads) {
         thread.join();
     }
+    // Every case is acknowledged once and is in one of the two vaults, with its item.
+    ASSERT_TRUE(waitFor([&] {
+        return std::all_of(recorders.begin(), recorders.end(),
+                           [](const ReplyRecorder& r) { return r.finalCount(); });
+    }));
     for (ReplyRecorder& recorder : recorders) {
-        const std::vector<Reply> replies = recorder.replies();
-        ASSERT_EQ(replies.size(), size_t(kRequestsPerThread));
-        for (const Reply& reply : replies) {
-            EXPECT_EQ(reply.strCode, QStringLiteral("commandNotSupportError"));
+        EXPECT_EQ(recorder.finalCount(), 1);
+        EXPECT_EQ(recorder.last().code, RC_SUCCESS);
+    }
+    int stored = 0;
+    for (const char* folder : {"db", "db2"}) {
+        CaseDatabase database = vault(folder);
+        for (const QVariant& element : database.getAllCase()) {
+            ++stored;
+            EXPECT_EQ(database.getCaseItemList(element.toMap().value(KEY_CASE_ID).toInt()).size(), 1);
         }
+    }
+    EXPECT_EQ(stored, kThreads * kCasesPerThread);
+}
+
+// The file-size limit stays in a second process of this program: it runs the disabled test below.
+TEST(PluginCasesFullVault, CommandsAnswerFailureNeverSuccessAndEarlierCasesSurvive)
+{
+    runDisabledTestInChild("PluginCasesTest.DISABLED_FullVaultFolderInThisProcess");
+}
+
+TEST_F(PluginCasesTest, DISABLED_FullVaultFolderInThisProcess)
+{
+    // Items are told apart by their start; big images make every few of them need a new page.
+    qint64 nextStart = 1700000000000;
+    QSet<int> acknowledgedCases;
+    QSet<qint64> acknowledgedItems;
+    // Adds one item to case `caseId`, or with a new case for 0; says whether it was acknowledged.
+    auto add = [&](int caseId) {
+        QVariantMap entry = item(QStringLiteral("cam1"), false, nextStart += 1000);
+        entry.insert(KEY_OBJ_IMAGE, QString(3000, QLatin1Char('i')));
+        entry.insert(KEY_CASE_ID, caseId);
+        const Reply reply = caseId ? call(CMD_ADD_CASE_ITEM, entry)
+                                   : call(CMD_ADD_CASE_WITH_ITEM, QVariantMap{{KEY_CASE_ITEM, entry}});
+        if (reply.code == RC_SUCCESS) {
+            acknowledgedCases.insert(caseId ? caseId : caseIdOf(reply));
+            acknowledgedItems.insert(nextStart);
+        }
+        return reply.code == RC_SUCCESS;
+    };
+    for (int c = 0; c < 3; ++c) {
+        ASSERT_TRUE(add(0));
+    }
+    const int firstCase = *std::min_element(acknowledgedCases.begin(), acknowledgedCases.end());
+    int refused = 0;
+    {
+        // Full: the vault file may not grow.
+        FileSizeLimit full(QFileInfo(path("db") + QStringLiteral("/PluginDelvix/CaseVault.db")).size());
+        for (int round = 0; round < 40; ++round) {
+            refused += (add(0) ? 0 : 1) + (add(firstCase) ? 0 : 1);
+            const Reply list = call(CMD_GET_CASE_LIST, QVariant()); // reads keep answering
+            EXPECT_EQ(list.code, RC_SUCCESS);
+            EXPECT_GE(list.payload.toList().size(), 3);
+        }
+        EXPECT_EQ(call(CMD_RETRIEVE_CASE_ITEM_MODEL, firstCase).code, RC_SUCCESS);
+    }
+    EXPECT_GE(refused, 5) << "the limit refused nothing";
+    EXPECT_TRUE(add(0)) << "writes did not resume";
+
+    // A fresh instance holds every acknowledged case and item. A case answered failure went in
+    // before its item was refused, and stays (as with any item failure) without it.
+    CaseDatabase reopened = vault();
+    QSet<qint64> storedStarts;
+    for (const QVariant& record : reopened.getAllCase()) {
+        const int caseId = record.toMap().value(KEY_CASE_ID).toInt();
+        const QVariantList items = reopened.getCaseItemList(caseId);
+        EXPECT_TRUE(acknowledgedCases.contains(caseId) || items.isEmpty()) << caseId;
+        for (const QVariant& stored : items) {
+            storedStarts.insert(stored.toMap().value(KEY_START_TIMESTAMP).toLongLong());
+        }
+    }
+    for (int caseId : acknowledgedCases) {
+        EXPECT_TRUE(reopened.containCase(caseId)) << caseId;
+    }
+    for (qint64 start : acknowledgedItems) {
+        EXPECT_TRUE(storedStarts.contains(start)) << "the item starting " << start << " is missing";
     }
 }
 
-TEST(PluginDelvixSrvDispatch, PluginWorksWithoutLoggingLibrary)
-{
-    LogFacility::reload("/nonexistent/libWemloLogUtl.so");
-    PluginDelvixSrv plugin;
-    EXPECT_TRUE(plugin.InitialPluginBase(nullptr));
-    plugin.AllPluginLoaded();
-    expectOneRefusal(plugin, QStringLiteral("noSuchCommand"));
-}
+#include "PluginDelvixSrvTest.moc"

@@ -1,0 +1,753 @@
+// Attribute and re-identification search over the real store, filled with a few hand-made objects:
+// which requests find which objects with which fields, limits, failures and stops of the worker,
+// the scheduler's order and stops, and the search commands through Request.
+#include "AttributeQueryWorker.h"
+#include "AttributeRetriever.h"
+#include "DelvixKeys.h"
+#include "HostFakes.h"
+#include "PluginDelvixSrv.h"
+#include "ReplyRecorder.h"
+#include "SearchStore.h"
+
+#include <QTemporaryDir>
+
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <limits>
+#include <optional>
+#include <thread>
+
+using namespace Qt::StringLiterals;
+
+namespace {
+
+constexpr qint64 T = 1700000000; // seconds
+
+int g_clientA = 0;
+int g_clientB = 0;
+void* const kClientA = &g_clientA;
+void* const kClientB = &g_clientB;
+
+// A stored 512-float vector along one axis: vectors of different axes score 0, of one axis 1.
+QJsonArray axis(int index)
+{
+    QJsonArray vector;
+    for (int i = 0; i < 512; ++i) {
+        vector.append(i == index ? 1 : 0);
+    }
+    return vector;
+}
+
+QJsonArray path(std::initializer_list<std::pair<double, double>> points)
+{
+    QJsonArray trajectory;
+    for (const auto& [x, y] : points) {
+        trajectory.append(QJsonObject{{u"x"_s, x}, {u"y"_s, y}});
+    }
+    return trajectory;
+}
+
+QJsonObject cameraObject(qint64 id, const QString& type, qint64 start, qint64 end,
+                         const QJsonObject& attributes, const QJsonObject& body, const QJsonObject& more = {})
+{
+    QJsonObject object{
+        {u"ID"_s, id},       {u"ObjectType"_s, type},       {u"StartTime"_s, start},
+        {u"EndTime"_s, end}, {u"Attributes"_s, attributes}, {u"Thumbnail"_s, QJsonArray{body}}};
+    for (auto it = more.begin(); it != more.end(); ++it) {
+        object.insert(it.key(), it.value());
+    }
+    return object;
+}
+
+// The worker's callback into a reply recorder (payload: the record), noting each call's thread.
+class Hits : public ReplyRecorder
+{
+public:
+    AttributeQueryWorker::Callback worker()
+    {
+        return [this, reply = callback()](bool finished, const QVariantMap& record) {
+            if (before) {
+                before(finished, record);
+            }
+            {
+                QMutexLocker lock(&m_mutex);
+                m_threads.push_back(std::this_thread::get_id());
+            }
+            reply(finished, QString(), QString(), record);
+        };
+    }
+    std::vector<qulonglong> ids() const
+    {
+        std::vector<qulonglong> ids;
+        for (const QVariant& hit : progress()) {
+            ids.push_back(hit.toMap().value(KEY_OBJECT_ID).toULongLong());
+        }
+        return ids;
+    }
+    // Exactly one final call, the last, with an empty record.
+    bool endedOnce() const { return finalCount() == 1 && last().final && last().payload.toMap().isEmpty(); }
+    std::vector<std::thread::id> threads() const
+    {
+        QMutexLocker lock(&m_mutex);
+        return m_threads;
+    }
+
+    std::function<void(bool, const QVariantMap&)> before; // runs on the calling thread, first
+
+private:
+    mutable QMutex m_mutex;
+    std::vector<std::thread::id> m_threads; // guarded by m_mutex
+};
+
+// A one-shot gate a callback waits at while the test acts.
+class Gate
+{
+public:
+    void open()
+    {
+        std::lock_guard<std::mutex> lock(m_mutex);
+        m_open = true;
+        m_changed.notify_all();
+    }
+    bool wait()
+    {
+        std::unique_lock<std::mutex> lock(m_mutex);
+        return m_changed.wait_for(lock, std::chrono::seconds(10), [this] { return m_open; });
+    }
+
+private:
+    std::mutex m_mutex;
+    std::condition_variable m_changed;
+    bool m_open = false;
+};
+
+QVariantMap request(const QStringList& locations, QVariantMap extra = {})
+{
+    extra.insert(KEY_LOC_ID_LIST, locations);
+    if (!extra.contains(KEY_START_TIMESTAMP)) {
+        extra.insert(KEY_START_TIMESTAMP, qulonglong(T) * 1000);
+    }
+    if (!extra.contains(KEY_END_TIMESTAMP)) {
+        extra.insert(KEY_END_TIMESTAMP, qulonglong(T + 3600) * 1000);
+    }
+    return extra;
+}
+
+// The first `count` of the 300 people at Loc3, one a second from T + 1000.
+QVariantMap crowd(int count)
+{
+    return request({u"Loc3"_s}, {{KEY_START_TIMESTAMP, qulonglong(T + 1000) * 1000},
+                                 {KEY_END_TIMESTAMP, qulonglong(T + 1000 + count - 1) * 1000}});
+}
+
+class SearchTest : public ::testing::Test
+{
+protected:
+    // Loc1: person 1 walks through the zone and across the line x = 0.5, person 2 stays in the
+    // zone, vehicle 3 has a plate, 9 is outside the hour. Loc2: person 4, the body of person 1.
+    // Loc3: 300 people without vectors.
+    static void SetUpTestSuite()
+    {
+        s_folder = new QTemporaryDir;
+        SearchStore store(s_folder->path());
+        QJsonObject face1{{u"image"_s, u"face1"_s},
+                          {u"feature"_s, axis(1)},
+                          {u"face_detection_info"_s, QJsonObject{{u"filtered"_s, 0}}}};
+        QJsonObject face2{{u"image"_s, u"face2"_s},
+                          {u"feature"_s, axis(3)},
+                          {u"face_detection_info"_s, QJsonObject{{u"filtered"_s, 1}}}};
+        QJsonObject plate{{u"image"_s, u"plate3"_s},
+                          {u"PlateNumber"_s, u"AB123"_s},
+                          {u"detection_info"_s, QJsonObject{{u"filtered"_s, 0}}}};
+        const QJsonArray loc1{
+            cameraObject(1, u"Human"_s, T + 10, T + 20,
+                         {{u"Age"_s, u"adult"_s},
+                          {u"Gender"_s, 1},
+                          {u"Accessories"_s, QJsonArray{1}},
+                          {u"UpperColor"_s, QJsonArray{2, 3}},
+                          {u"LowerColor"_s, QJsonArray{4}}},
+                         {{u"image"_s, u"body1"_s}, {u"feature"_s, axis(0)}},
+                         {{u"FaceThumbnail"_s, QJsonArray{face1}},
+                          {u"Trajectory"_s, path({{0.1, 0.5}, {0.4, 0.5}, {0.6, 0.5}, {0.9, 0.5}})}}),
+            cameraObject(2, u"Human"_s, T + 30, T + 100, {{u"Gender"_s, 2}, {u"UpperColor"_s, QJsonArray{5}}},
+                         {{u"image"_s, u"body2"_s}, {u"feature"_s, axis(2)}},
+                         {{u"FaceThumbnail"_s, QJsonArray{face2}},
+                          {u"Trajectory"_s, path({{0.45, 0.45}, {0.46, 0.5}, {0.45, 0.55}})}}),
+            cameraObject(3, u"Vehicle"_s, T + 50, T + 60,
+                         {{u"Type"_s, 1}, {u"Color"_s, QJsonArray{4}}, {u"PlateNumber"_s, u"AB123"_s}},
+                         {{u"image"_s, u"body3"_s}},
+                         {{u"LicensePlateThumbnail"_s, QJsonArray{plate}},
+                          {u"Trajectory"_s, path({{0.9, 0.9}, {0.95, 0.95}})}}),
+            cameraObject(9, u"Human"_s, T + 5000, T + 5001, {}, {{u"image"_s, u"late"_s}})};
+        ASSERT_EQ(store.put(1, loc1), 4);
+        ASSERT_EQ(store.put(2, {cameraObject(4, u"Human"_s, T + 15, T + 16, {{u"Gender"_s, 1}},
+                                             {{u"image"_s, u"body4"_s}, {u"feature"_s, axis(0)}})}),
+                  1);
+        QJsonArray crowd;
+        for (int i = 0; i < 300; ++i) {
+            crowd.append(
+                cameraObject(100 + i, u"Human"_s, T + 1000 + i, T + 1000 + i, {}, {{u"image"_s, u"c"_s}}));
+        }
+        ASSERT_EQ(store.put(3, crowd), 300);
+    }
+    static void TearDownTestSuite()
+    {
+        delete s_folder;
+        s_folder = nullptr;
+    }
+
+    void SetUp() override { worker->setTamsa(store); }
+
+    std::vector<qulonglong> find(const QVariantMap& params)
+    {
+        Hits hits;
+        worker->query(params, hits.worker());
+        EXPECT_TRUE(hits.endedOnce());
+        return hits.ids();
+    }
+
+    static QTemporaryDir* s_folder;
+    std::shared_ptr<SearchStore> store = std::make_shared<SearchStore>(s_folder->path());
+    std::shared_ptr<AttributeQueryWorker> worker = std::make_shared<AttributeQueryWorker>();
+};
+
+QTemporaryDir* SearchTest::s_folder = nullptr;
+
+using Ids = std::vector<qulonglong>;
+
+} // namespace
+
+TEST_F(SearchTest, RequestsFindTheirObjects)
+{
+    const QString zone = u"[[0.3,0.3],[0.7,0.3],[0.7,0.7],[0.3,0.7]]"_s;
+    const QString line = u"[[0.5,0],[0.5,1]]"_s;
+    const auto rule = [](const QString& type, const QString& trace, int direction) {
+        return QVariantMap{{KEY_RULE_INFO, QVariantMap{{KEY_TYPE, type},
+                                                       {KEY_TRACE, trace},
+                                                       {KEY_DURATION, 30},
+                                                       {KEY_DIRECTION, direction}}}};
+    };
+    const QStringList loc1{u"Loc1"_s};
+    struct Row
+    {
+        const char* name;
+        QVariantMap params;
+        Ids expected; // in order
+    };
+    const std::vector<Row> rows{
+        {"one location, in time order", request(loc1), {1, 2, 3}},
+        {"two locations merged by time", request({u"Loc1"_s, u""_s, u"Loc2"_s}), {1, 4, 2, 3}},
+        {"unsorted: location by location",
+         request({u"Loc2"_s, u"Loc1"_s}, {{KEY_DO_NOT_SORT, true}}),
+         {4, 1, 2, 3}},
+        {"descending", request(loc1, {{KEY_DESCENDING, true}}), {3, 2, 1}},
+        {"an unparsable location ends the list", request({u"Loc1"_s, u"X"_s, u"Loc2"_s}), {1, 2, 3}},
+        {"no location", request({}), {}},
+        {"empty locations only", request({u""_s, u""_s}), {}},
+        // Milliseconds are cut to seconds, not rounded: 20.999 s still overlaps person 1's end,
+        // and 29.999 s ends before person 2 starts.
+        {"window in milliseconds",
+         request(loc1, {{KEY_START_TIMESTAMP, qulonglong(T + 20) * 1000 + 999},
+                        {KEY_END_TIMESTAMP, qulonglong(T + 29) * 1000 + 999}}),
+         {1}},
+        {"an end beyond 32-bit seconds is the last second",
+         request(loc1, {{KEY_END_TIMESTAMP, (qulonglong(1) << 32) * 1000 + 5000}}),
+         {1, 2, 3, 9}},
+        {"primary person attribute",
+         request({u"Loc1"_s, u"Loc2"_s}, {{KEY_HUMAN_INFO, R"({"Gender":1})"}}),
+         {1, 4}},
+        {"other person attribute", request(loc1, {{KEY_HUMAN_INFO, R"({"UpperColor":[5]})"}}), {2}},
+        {"both kinds must hold", request(loc1, {{KEY_HUMAN_INFO, R"({"Gender":1,"UpperColor":[5]})"}}), {}},
+        {"bad JSON still means people", request(loc1, {{KEY_HUMAN_INFO, "{not json"}}), {1, 2}},
+        {"vehicle attributes",
+         request(loc1, {{KEY_VEHICLE_INFO, R"({"Type":1,"Color":[4],"PlateNumber":"AB1"})"}}),
+         {3}},
+        {"a vehicle attribute that differs", request(loc1, {{KEY_VEHICLE_INFO, R"({"Color":[5]})"}}), {}},
+        {"plate pattern", request(loc1, {{KEY_PLATE_NUMBER, "ab*"}}), {3}},
+        {"intrusion", request(loc1, rule(u"intrusion"_s, zone, 0)), {1, 2}},
+        {"loitering", request(loc1, rule(KEY_LOITERING, zone, 0)), {2}},
+        {"line crossed positive to negative", request(loc1, rule(KEY_LINE_CROSSING, line, 2)), {1}},
+        {"line not crossed negative to positive", request(loc1, rule(KEY_LINE_CROSSING, line, 1)), {}},
+        {"a direction counts only for a line rule", request(loc1, rule(u"intrusion"_s, line, 1)), {1}},
+        {"body vector", request(loc1, {{KEY_FEATURE, axis(0).toVariantList()}}), {1}},
+        {"face vector", request(loc1, {{KEY_FACE_FEATURE, axis(1).toVariantList()}}), {1}},
+        {"an empty vector is no condition", request(loc1, {{KEY_FEATURE, QVariantList()}}), {1, 2, 3}},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.name);
+        EXPECT_EQ(find(row.params), row.expected);
+    }
+}
+
+TEST_F(SearchTest, HitsCarryTheStoredFields)
+{
+    Hits hits;
+    worker->query(request({u"Loc1"_s}), hits.worker());
+    ASSERT_EQ(hits.ids(), (Ids{1, 2, 3}));
+    const QVariantMap person = hits.progress()[0].toMap();
+    EXPECT_EQ(person.value(KEY_OBJ_TYPE).toString(), "Human");
+    EXPECT_EQ(person.value(KEY_LOC_ID).toString(), "Loc1");
+    EXPECT_EQ(person.value(KEY_START_TIMESTAMP).toLongLong(), (T + 10) * 1000);
+    EXPECT_EQ(person.value(KEY_END_TIMESTAMP).toLongLong(), (T + 20) * 1000);
+    const QVariantList trajectory = person.value(KEY_TRAJECTORY).toList();
+    ASSERT_EQ(trajectory.size(), 4);
+    EXPECT_DOUBLE_EQ(trajectory[1].toMap().value(KEY_X).toDouble(), 0.4);
+    EXPECT_DOUBLE_EQ(trajectory[1].toMap().value(KEY_Y).toDouble(), 0.5);
+    EXPECT_EQ(person.value(KEY_OBJ_IMAGE).toString(), "body1");
+    EXPECT_EQ(person.value(KEY_FEATURE).toList(), axis(0).toVariantList());
+    EXPECT_EQ(person.value(KEY_FACE_IMAGE).toString(), "face1");
+    EXPECT_EQ(person.value(KEY_FACE_FEATURE).toList(), axis(1).toVariantList());
+    EXPECT_EQ(person.value(KEY_OBJECT_AGE).toString(), "adult");
+    EXPECT_EQ(person.value(KEY_OBJECT_GENDER).toInt(), 1);
+    EXPECT_EQ(person.value(KEY_OBJECT_ACCESSORIES).toList(), (QVariantList{1}));
+    EXPECT_EQ(person.value(KEY_OBJECT_UPPER_COLOR).toList(), (QVariantList{2, 3}));
+    EXPECT_EQ(person.value(KEY_OBJECT_LOWER_COLOR).toList(), (QVariantList{4}));
+    EXPECT_EQ(person.value(KEY_OBJECT_VEHICLE_COLOR), QVariant(QVariantList()));
+    EXPECT_EQ(person.value(KEY_OBJECT_VEHICLE_TYPE), QVariant(QString()));
+    EXPECT_EQ(person.size(), 17);
+
+    // A filtered face crop gives neither image nor vector; missing attributes their defaults.
+    const QVariantMap filtered = hits.progress()[1].toMap();
+    EXPECT_FALSE(filtered.contains(KEY_FACE_IMAGE));
+    EXPECT_FALSE(filtered.contains(KEY_FACE_FEATURE));
+    EXPECT_EQ(filtered.value(KEY_OBJECT_AGE), QVariant(QString()));
+    EXPECT_EQ(filtered.value(KEY_OBJECT_ACCESSORIES), QVariant(QVariantList()));
+
+    const QVariantMap vehicle = hits.progress()[2].toMap();
+    EXPECT_EQ(vehicle.value(KEY_OBJ_TYPE).toString(), "Vehicle");
+    EXPECT_EQ(vehicle.value(KEY_PLATE_IMAGE).toString(), "plate3");
+    EXPECT_EQ(vehicle.value(KEY_PLATE_NUMBER).toString(), "AB123");
+    EXPECT_EQ(vehicle.value(KEY_OBJECT_VEHICLE_COLOR).toList(), (QVariantList{4}));
+    EXPECT_EQ(vehicle.value(KEY_OBJECT_VEHICLE_TYPE).toInt(), 1);
+    EXPECT_FALSE(vehicle.value(KEY_FEATURE).isValid());
+    EXPECT_EQ(vehicle.size(), 17);
+}
+
+TEST_F(SearchTest, AtMost201HitsAndFailuresEndWithTheFinalCallOnly)
+{
+    Hits many;
+    worker->query(crowd(300), many.worker());
+    EXPECT_EQ(many.ids().size(), 201u);
+    EXPECT_EQ(many.ids().back(), 300u);
+    EXPECT_TRUE(many.endedOnce());
+    EXPECT_EQ(store->closes, 1);
+    EXPECT_EQ(store->releases, 1);
+
+    store->firstStatus = TAMSA_E_BAD_QUERY;
+    EXPECT_EQ(find(crowd(3)), Ids{});
+    EXPECT_EQ(store->closes, 1); // nothing was opened, nothing is closed
+    EXPECT_EQ(store->releases, 2);
+
+    // A failing initialisation is only logged; a failing Next keeps the hits so far.
+    store->firstStatus = 0;
+    store->initStatus = TAMSA_E_NO_STORAGE_PATH;
+    store->failNextAfter = 2;
+    EXPECT_EQ(find(crowd(5)), (Ids{100, 101}));
+    EXPECT_EQ(store->open(), 0);
+    EXPECT_EQ(store->releases, 3);
+}
+
+TEST_F(SearchTest, StopEndsOnlyTheSearchItWasMeantFor)
+{
+    // A stop before the search begins ends it with no hits, and is then used up.
+    const quint64 first = worker->searchGeneration();
+    EXPECT_TRUE(worker->stop(first));
+    EXPECT_EQ(find(crowd(50)), Ids{});
+    EXPECT_FALSE(worker->stop(first));
+    EXPECT_EQ(find(crowd(50)).size(), 50u);
+
+    // A stop during the search ends it at the next check.
+    Hits stopped;
+    stopped.before = [this](bool finished, const QVariantMap& record) {
+        if (!finished && record.value(KEY_OBJECT_ID).toULongLong() == 104) {
+            worker->stop();
+        }
+    };
+    worker->query(crowd(50), stopped.worker());
+    EXPECT_EQ(stopped.ids().size(), 5u);
+    EXPECT_TRUE(stopped.endedOnce());
+}
+
+TEST_F(SearchTest, ReIdSearchesEveryLocationOnItsOwn)
+{
+    // An empty entry leaves no location: no store search for it, the others go on.
+    const QVariantMap params =
+        request({u"Loc2"_s, u""_s, u"Loc1"_s, u"Loc3"_s}, {{KEY_FEATURE, axis(0).toVariantList()},
+                                                           {KEY_FACE_FEATURE, axis(1).toVariantList()},
+                                                           {KEY_HUMAN_INFO, R"({"Gender":2})"}});
+    worker->setParallel(false);
+    Hits serial;
+    worker->reId(params, serial.worker());
+    // In list order, the person conditions ignored, on the calling thread; scores as the store gave them.
+    EXPECT_EQ(serial.ids(), (Ids{4, 1}));
+    EXPECT_TRUE(serial.endedOnce());
+    for (const std::thread::id& thread : serial.threads()) {
+        EXPECT_EQ(thread, std::this_thread::get_id());
+    }
+    EXPECT_EQ(store->firsts, 3);
+    EXPECT_EQ(store->maxOpen, 1);
+    const QVariantMap person = serial.progress()[1].toMap();
+    EXPECT_EQ(person.value(KEY_SCORE).typeId(), QMetaType::Float);
+    EXPECT_FLOAT_EQ(person.value(KEY_SCORE).toFloat(), 1.0f);
+    EXPECT_FLOAT_EQ(person.value(KEY_FACE_SCORE).toFloat(), 1.0f);
+
+    // Parallel: every hit from the pool's threads, the final call on the caller's after all of them.
+    worker->setParallel(true);
+    worker->setPeriods(3);
+    Hits parallel;
+    worker->reId(params, parallel.worker());
+    EXPECT_EQ(parallel.ids().size(), 2u);
+    EXPECT_TRUE(parallel.endedOnce());
+    EXPECT_NE(parallel.threads().front(), std::this_thread::get_id());
+    EXPECT_EQ(parallel.threads().back(), std::this_thread::get_id());
+    EXPECT_EQ(store->open(), 0);
+
+    // No location: only the final call. One location on its own: hits only, no final call.
+    Hits none;
+    worker->reId(request({}), none.worker());
+    EXPECT_TRUE(none.endedOnce());
+    Hits single;
+    worker->partialReIdSearch(request({u"Loc1"_s}, {{KEY_FACE_FEATURE, axis(1).toVariantList()}}),
+                              single.worker());
+    EXPECT_EQ(single.ids(), Ids{1});
+    EXPECT_EQ(single.finalCount(), 0);
+    // Every search is off the stop list once it is closed.
+    worker->stop();
+    EXPECT_EQ(store->staleAborts, 0);
+}
+
+TEST_F(SearchTest, StopDuringReIdEndsEveryLocation)
+{
+    store->holdUntilAbort = true;
+    worker->setPeriods(3);
+    Hits held;
+    std::thread search([&] { worker->reId(request({u"Loc1"_s, u"Loc2"_s, u"Loc3"_s}), held.worker()); });
+    EXPECT_TRUE(store->waitHeld(3));
+    worker->stop();
+    search.join();
+    EXPECT_TRUE(held.endedOnce());
+    EXPECT_TRUE(held.ids().empty());
+    EXPECT_EQ(store->aborts, 3);
+    EXPECT_EQ(store->staleAborts, 0);
+    EXPECT_EQ(store->closes, 3);
+
+    // The stop is over with its search: the next one runs in full.
+    store->holdUntilAbort = false;
+    Hits next;
+    worker->reId(request({u"Loc1"_s}, {{KEY_FEATURE, axis(0).toVariantList()}}), next.worker());
+    EXPECT_EQ(next.ids(), Ids{1});
+}
+
+TEST_F(SearchTest, CosineScores)
+{
+    const auto score = [this](std::vector<float> a, QVariantList b) {
+        return worker->getScore(a, b, int(a.size()));
+    };
+    EXPECT_NEAR(score({3, 4}, {4, 3}), 0.96f, 1e-6);
+    EXPECT_FLOAT_EQ(score({1, 0}, {1, 0, 5}), 1.0f); // the candidate's tail is ignored
+    EXPECT_EQ(score({1, 1}, {1}), 0.0f);             // a short candidate
+    EXPECT_EQ(score({0, 0}, {0, 0}), 1.0f);
+    EXPECT_EQ(score({0, 0}, {1, 0}), 0.0f);
+    EXPECT_EQ(score({1, 0}, {-1, 0}), 0.0f); // never negative
+    EXPECT_EQ(score({1, 0}, {std::numeric_limits<double>::quiet_NaN(), 0}), 0.0f);
+    EXPECT_EQ(score({std::numeric_limits<float>::infinity(), 1}, {1, 1}), 0.0f);
+    EXPECT_FLOAT_EQ(score({1, 1}, {u"x"_s, 1}), std::sqrt(0.5f)); // a text counts as 0
+
+    QVariantMap record{{KEY_FEATURE, QVariantList{1.0, 0.0}}};
+    worker->calculateScore({}, {0.49f, std::sqrt(1 - 0.49f * 0.49f)}, record);
+    EXPECT_EQ(record.value(KEY_SCORE).toFloat(), 0.0f); // below the threshold it is stored as 0
+    EXPECT_TRUE(record.contains(KEY_FACE_FEATURE));
+    EXPECT_EQ(record.value(KEY_FACE_SCORE).toFloat(), 0.0f);
+}
+
+TEST_F(SearchTest, TimeZoneIsTheStandardBiasInQuarterHours)
+{
+    EXPECT_EQ(AttributeQueryWorker::makeTZDS(-480, false).wZone, 16);
+    EXPECT_EQ(AttributeQueryWorker::makeTZDS(300, false).wZone, 68);
+    EXPECT_EQ(AttributeQueryWorker::makeTZDS(-330, true).wZone, 26); // truncated toward zero
+    EXPECT_EQ(AttributeQueryWorker::makeTZDS(0, true).wDaylight, 1);
+    const std::optional<QByteArray> previous =
+        qEnvironmentVariableIsSet("TZ") ? std::optional(qgetenv("TZ")) : std::nullopt;
+    // The standard offset counts even while daylight saving time is in force.
+    for (const auto& [zone, wZone] : std::vector<std::pair<const char*, int>>{
+             {"CST-8", 16}, {"UTC0", 48}, {"EST5EDT,M3.2.0,M11.1.0", 68}}) {
+        qputenv("TZ", zone);
+        EXPECT_EQ(worker->getTamsaTZDS().wZone, wZone) << zone;
+    }
+    previous ? qputenv("TZ", *previous) : qunsetenv("TZ");
+}
+
+// ---- the scheduler: one search at a time, in arrival order ----------------------------------
+
+class RetrieverTest : public SearchTest
+{
+protected:
+    void SetUp() override
+    {
+        SearchTest::SetUp();
+        retriever->setAttributeRetriever(worker);
+    }
+    std::unique_ptr<AttributeRetriever> retriever = std::make_unique<AttributeRetriever>();
+};
+
+TEST_F(RetrieverTest, SearchesRunOneAfterAnotherInArrivalOrder)
+{
+    store->nextDelayMs = 2;
+    Hits first;
+    Hits second;
+    Hits third;
+    std::atomic<bool> secondStartedEarly{false};
+    second.before = [&](bool, const QVariantMap&) {
+        secondStartedEarly = secondStartedEarly || !first.finalCount();
+    };
+    retriever->query(kClientA, crowd(5), first.worker());
+    // Null identifiers are searches like any other: queued, never on a second thread, and a
+    // stop for no query stops none of them.
+    retriever->query(nullptr, crowd(5), second.worker());
+    retriever->query(nullptr, crowd(5), third.worker());
+    retriever->stop(nullptr);
+    EXPECT_TRUE(third.waitFinal());
+    EXPECT_TRUE(first.endedOnce());
+    EXPECT_TRUE(second.endedOnce());
+    EXPECT_EQ(first.ids().size(), 5u);
+    EXPECT_EQ(second.ids().size(), 5u);
+    EXPECT_EQ(third.ids().size(), 5u);
+    EXPECT_FALSE(secondStartedEarly);
+    EXPECT_EQ(store->maxOpen, 1);
+    EXPECT_FALSE(retriever->hasNextTask());
+}
+
+TEST_F(RetrieverTest, StopCancelsAQueuedSearchAtOnce)
+{
+    Gate firstHit;
+    Gate proceed;
+    Hits running;
+    running.before = [&](bool finished, const QVariantMap& record) {
+        if (!finished && record.value(KEY_OBJECT_ID).toULongLong() == 100) {
+            firstHit.open();
+            proceed.wait();
+        }
+    };
+    Hits queued;
+    retriever->query(kClientA, crowd(40), running.worker());
+    ASSERT_TRUE(firstHit.wait());
+    retriever->query(kClientB, crowd(40), queued.worker());
+    EXPECT_TRUE(retriever->hasNextTask());
+    retriever->stop(kClientB);
+    // Answered on the stopping thread while the running search is still under way.
+    EXPECT_TRUE(queued.endedOnce());
+    EXPECT_EQ(queued.threads().front(), std::this_thread::get_id());
+    EXPECT_FALSE(retriever->hasNextTask());
+    proceed.open();
+    EXPECT_TRUE(running.waitFinal());
+    EXPECT_EQ(running.ids().size(), 40u);
+    EXPECT_EQ(store->firsts, 1);
+    // A stop for a search that is neither queued nor running does nothing.
+    retriever->stop(kClientB);
+    EXPECT_EQ(queued.finalCount(), 1);
+}
+
+TEST_F(RetrieverTest, StopEndsTheRunningSearchAndTheNextOneStarts)
+{
+    Gate secondHit;
+    Gate proceed;
+    Hits running;
+    running.before = [&](bool finished, const QVariantMap& record) {
+        if (!finished && record.value(KEY_OBJECT_ID).toULongLong() == 101) {
+            secondHit.open();
+            proceed.wait();
+        }
+    };
+    Hits sameClient;
+    Hits otherClient;
+    retriever->query(kClientA, crowd(300), running.worker());
+    ASSERT_TRUE(secondHit.wait());
+    // A new search of the running client waits behind it; the running one goes on.
+    retriever->query(kClientA, crowd(300), sameClient.worker());
+    retriever->query(kClientB, crowd(300), otherClient.worker());
+    retriever->stop(kClientA);
+    proceed.open();
+    EXPECT_TRUE(otherClient.waitFinal());
+    // Ended at the next check after the stop; the queued search of the same client was not
+    // cancelled: it runs next, in full, then the other client's.
+    EXPECT_EQ(running.ids().size(), 2u);
+    EXPECT_TRUE(running.endedOnce());
+    EXPECT_EQ(sameClient.ids().size(), 201u);
+    EXPECT_EQ(otherClient.ids().size(), 201u);
+}
+
+TEST_F(RetrieverTest, LateStopNeverEndsTheFollowingSearch)
+{
+    // The window: the first search has cleared its stop flag and is making its final call,
+    // while the scheduler still names it current. A stop of that client decided now is meant
+    // for the first search and must not reach the second, queued under the same client.
+    Gate finalEntered;
+    Gate proceed;
+    Hits first;
+    first.before = [&](bool finished, const QVariantMap&) {
+        if (finished) {
+            finalEntered.open();
+            proceed.wait();
+        }
+    };
+    Hits second;
+    retriever->query(kClientA, crowd(5), first.worker());
+    retriever->query(kClientA, crowd(5), second.worker());
+    ASSERT_TRUE(finalEntered.wait());
+    retriever->stop(kClientA);
+    proceed.open();
+    EXPECT_TRUE(second.waitFinal());
+    EXPECT_EQ(second.ids().size(), 5u);
+}
+
+TEST_F(RetrieverTest, SearchStartedWhileTheThreadEndsStillRuns)
+{
+    for (int round = 0; round < 200; ++round) {
+        Hits hits;
+        retriever->query(round % 2 ? kClientA : kClientB, crowd(1), hits.worker());
+        ASSERT_TRUE(hits.waitFinal(5000)) << "round " << round;
+        EXPECT_EQ(hits.ids().size(), 1u);
+    }
+}
+
+TEST_F(RetrieverTest, DestructionCancelsQueuedStopsRunningAndWaits)
+{
+    store->nextDelayMs = 2;
+    Hits running;
+    Hits queuedA;
+    Hits queuedB;
+    retriever->query(kClientA, crowd(300), running.worker());
+    ASSERT_TRUE(waitFor([&] { return !running.progress().empty(); }));
+    retriever->reId(kClientB, crowd(300), queuedA.worker());
+    retriever->query(kClientB, crowd(300), queuedB.worker());
+    retriever.reset();
+    // Once the scheduler is gone, every search has had its one final call and nothing of it runs.
+    EXPECT_TRUE(running.endedOnce());
+    EXPECT_TRUE(queuedA.endedOnce());
+    EXPECT_TRUE(queuedB.endedOnce());
+    EXPECT_TRUE(queuedA.ids().empty());
+    EXPECT_EQ(store->open(), 0);
+    EXPECT_EQ(store->firsts, 1);
+}
+
+TEST_F(RetrieverTest, DestroyedFromItsOwnCallback)
+{
+    // The last owner lets go inside a search's final call, on the scheduler's own thread.
+    std::weak_ptr<AttributeQueryWorker> owned = worker;
+    worker.reset();
+    AttributeRetriever* scheduler = retriever.release();
+    Gate firstHit;
+    Gate proceed;
+    Hits first;
+    first.before = [&, scheduler](bool finished, const QVariantMap&) {
+        if (!finished) {
+            firstHit.open();
+            proceed.wait();
+        } else {
+            delete scheduler;
+        }
+    };
+    Hits queued;
+    scheduler->query(kClientA, crowd(3), first.worker());
+    ASSERT_TRUE(firstHit.wait());
+    scheduler->query(kClientB, crowd(3), queued.worker());
+    proceed.open();
+    EXPECT_TRUE(queued.waitFinal());
+    EXPECT_TRUE(queued.endedOnce());
+    EXPECT_TRUE(queued.ids().empty());
+    EXPECT_EQ(first.ids().size(), 3u);
+    EXPECT_EQ(store->firsts, 1);
+    // The thread lets go of the worker on its way out.
+    EXPECT_TRUE(waitFor([&] { return owned.expired(); }));
+}
+
+// ---- the search commands through Request ----------------------------------------------------
+
+class SearchCommandsTest : public SearchTest
+{
+protected:
+    void SetUp() override
+    {
+        SearchTest::SetUp();
+        retriever->setAttributeRetriever(worker);
+        plugin.setAttributeRetriever(retriever);
+        collector->cameras.insert(u"Loc1"_s, u"camera-1"_s);
+        plugin.setCameraInformationCollector(collector);
+        plugin.InitialPluginBase(nullptr);
+    }
+    static RequestSenderInfo sender(void* client)
+    {
+        RequestSenderInfo info;
+        info.senderHandle = client;
+        return info;
+    }
+
+    QSharedPointer<AttributeRetriever> retriever = QSharedPointer<AttributeRetriever>::create();
+    QSharedPointer<FakeCollector> collector = QSharedPointer<FakeCollector>::create();
+    PluginDelvixSrv plugin;
+};
+
+TEST_F(SearchCommandsTest, DisabledStartCommandsAnswerAtOnceAndSearchNothing)
+{
+    plugin.setEnableDelvix({{u"faceEnable"_s, true}}); // no "enable": off
+    EXPECT_EQ(collector->settings().value(u"faceEnable"_s), QVariant(true));
+    for (const QString& command : {CMD_START_SEARCH, CMD_START_REID_SEARCH}) {
+        ReplyRecorder replies;
+        plugin.Request(command, request({u"Loc1"_s}), sender(kClientA), replies.callback());
+        ASSERT_EQ(replies.replies().size(), 1u) << qPrintable(command);
+        EXPECT_TRUE(replies.last().final);
+        EXPECT_EQ(replies.last().code, RC_SUCCESS);
+        EXPECT_FALSE(replies.last().payload.isValid());
+    }
+    EXPECT_EQ(store->releases, 0);
+
+    plugin.setEnableDelvix({{u"enable"_s, true}});
+    ReplyRecorder replies;
+    plugin.Request(CMD_START_SEARCH, request({u"Loc1"_s}), sender(kClientA), replies.callback());
+    EXPECT_TRUE(replies.waitFinal());
+    EXPECT_EQ(replies.progress().size(), 3u);
+}
+
+TEST_F(SearchCommandsTest, HitsStreamWithTheirCameraThenTheFinalReply)
+{
+    const QVariantMap bodyOfPerson1 =
+        request({u"Loc1"_s, u"Loc2"_s}, {{KEY_FEATURE, axis(0).toVariantList()}});
+    // The third time without a camera directory: every hit gets an empty camera.
+    for (const QString& command : {CMD_START_SEARCH, CMD_START_REID_SEARCH, CMD_START_SEARCH}) {
+        ReplyRecorder replies;
+        plugin.Request(command, bodyOfPerson1, sender(kClientA), replies.callback());
+        ASSERT_TRUE(replies.waitFinal()) << qPrintable(command);
+        std::map<qulonglong, QVariant> cameras; // Loc2 has no camera
+        for (const QVariant& hit : replies.progress()) {
+            cameras[hit.toMap().value(KEY_OBJECT_ID).toULongLong()] = hit.toMap().value(KEY_NODE_ID);
+        }
+        const QString camera1 = collector ? u"camera-1"_s : QString();
+        EXPECT_EQ(cameras, (std::map<qulonglong, QVariant>{{1, camera1}, {4, QString()}}));
+        EXPECT_EQ(replies.replies().size(), 3u);
+        EXPECT_EQ(replies.finalCount(), 1);
+        EXPECT_EQ(replies.last().code, RC_SUCCESS);
+        EXPECT_FALSE(replies.last().payload.isValid());
+        if (command == CMD_START_REID_SEARCH) {
+            collector.reset();
+            plugin.setCameraInformationCollector(collector);
+        }
+    }
+}
+
+TEST_F(SearchCommandsTest, StopCommandsStopOnlyTheClientsSearch)
+{
+    store->nextDelayMs = 10; // a search of some seconds unless stopped
+    for (const QString& stopCommand : {CMD_STOP_SEARCH, CMD_STOP_REID_SEARCH}) {
+        ReplyRecorder running;
+        plugin.Request(CMD_START_SEARCH, crowd(300), sender(kClientA), running.callback());
+        ASSERT_TRUE(running.waitReplies(2));
+        ReplyRecorder stopReplies;
+        plugin.Request(stopCommand, QVariant(), sender(kClientB), stopReplies.callback());
+        EXPECT_FALSE(running.last().final);
+        plugin.Request(stopCommand, QVariant(), sender(kClientA), stopReplies.callback());
+        EXPECT_TRUE(running.waitFinal());
+        EXPECT_LT(running.replies().size(), 202u) << qPrintable(stopCommand);
+        EXPECT_TRUE(stopReplies.replies().empty());
+    }
+}

@@ -9,6 +9,8 @@
 #include "ReplyRecorder.h"
 #include "SearchStore.h"
 
+#include <QJsonArray>
+#include <QJsonDocument>
 #include <QTemporaryDir>
 
 #include <gtest/gtest.h>
@@ -37,27 +39,6 @@ QJsonArray axis(int index)
         vector.append(i == index ? 1 : 0);
     }
     return vector;
-}
-
-QJsonArray path(std::initializer_list<std::pair<double, double>> points)
-{
-    QJsonArray trajectory;
-    for (const auto& [x, y] : points) {
-        trajectory.append(QJsonObject{{u"x"_s, x}, {u"y"_s, y}});
-    }
-    return trajectory;
-}
-
-QJsonObject cameraObject(qint64 id, const QString& type, qint64 start, qint64 end,
-                         const QJsonObject& attributes, const QJsonObject& body, const QJsonObject& more = {})
-{
-    QJsonObject object{
-        {u"ID"_s, id},       {u"ObjectType"_s, type},       {u"StartTime"_s, start},
-        {u"EndTime"_s, end}, {u"Attributes"_s, attributes}, {u"Thumbnail"_s, QJsonArray{body}}};
-    for (auto it = more.begin(); it != more.end(); ++it) {
-        object.insert(it.key(), it.value());
-    }
-    return object;
 }
 
 // The worker's callback into a reply recorder (payload: the record), noting each call's thread.
@@ -144,52 +125,46 @@ QVariantMap crowd(int count)
 class SearchTest : public ::testing::Test
 {
 protected:
-    // Loc1: person 1 walks through the zone and across the line x = 0.5, person 2 stays in the
-    // zone, vehicle 3 has a plate, 9 is outside the hour. Loc2: person 4, the body of person 1.
-    // Loc3: 300 people without vectors.
+    // Loc1 from T: person 1 walks through the zone and across the line x = 0.5, person 2 stays in
+    // the zone, vehicle 3 has a plate, 9 is outside the hour. Loc2: person 4, the body of person 1.
+    // Loc3: 300 people without vectors, one a second from T + 1000.
     static void SetUpTestSuite()
     {
         s_folder = new QTemporaryDir;
         SearchStore store(s_folder->path());
-        QJsonObject face1{{u"image"_s, u"face1"_s},
-                          {u"feature"_s, axis(1)},
-                          {u"face_detection_info"_s, QJsonObject{{u"filtered"_s, 0}}}};
-        QJsonObject face2{{u"image"_s, u"face2"_s},
-                          {u"feature"_s, axis(3)},
-                          {u"face_detection_info"_s, QJsonObject{{u"filtered"_s, 1}}}};
-        QJsonObject plate{{u"image"_s, u"plate3"_s},
-                          {u"PlateNumber"_s, u"AB123"_s},
-                          {u"detection_info"_s, QJsonObject{{u"filtered"_s, 0}}}};
-        const QJsonArray loc1{
-            cameraObject(1, u"Human"_s, T + 10, T + 20,
-                         {{u"Age"_s, u"adult"_s},
-                          {u"Gender"_s, 1},
-                          {u"Accessories"_s, QJsonArray{1}},
-                          {u"UpperColor"_s, QJsonArray{2, 3}},
-                          {u"LowerColor"_s, QJsonArray{4}}},
-                         {{u"image"_s, u"body1"_s}, {u"feature"_s, axis(0)}},
-                         {{u"FaceThumbnail"_s, QJsonArray{face1}},
-                          {u"Trajectory"_s, path({{0.1, 0.5}, {0.4, 0.5}, {0.6, 0.5}, {0.9, 0.5}})}}),
-            cameraObject(2, u"Human"_s, T + 30, T + 100, {{u"Gender"_s, 2}, {u"UpperColor"_s, QJsonArray{5}}},
-                         {{u"image"_s, u"body2"_s}, {u"feature"_s, axis(2)}},
-                         {{u"FaceThumbnail"_s, QJsonArray{face2}},
-                          {u"Trajectory"_s, path({{0.45, 0.45}, {0.46, 0.5}, {0.45, 0.55}})}}),
-            cameraObject(3, u"Vehicle"_s, T + 50, T + 60,
-                         {{u"Type"_s, 1}, {u"Color"_s, QJsonArray{4}}, {u"PlateNumber"_s, u"AB123"_s}},
-                         {{u"image"_s, u"body3"_s}},
-                         {{u"LicensePlateThumbnail"_s, QJsonArray{plate}},
-                          {u"Trajectory"_s, path({{0.9, 0.9}, {0.95, 0.95}})}}),
-            cameraObject(9, u"Human"_s, T + 5000, T + 5001, {}, {{u"image"_s, u"late"_s}})};
-        ASSERT_EQ(store.put(1, loc1), 4);
-        ASSERT_EQ(store.put(2, {cameraObject(4, u"Human"_s, T + 15, T + 16, {{u"Gender"_s, 1}},
-                                             {{u"image"_s, u"body4"_s}, {u"feature"_s, axis(0)}})}),
-                  1);
-        QJsonArray crowd;
-        for (int i = 0; i < 300; ++i) {
-            crowd.append(
-                cameraObject(100 + i, u"Human"_s, T + 1000 + i, T + 1000 + i, {}, {{u"image"_s, u"c"_s}}));
+        QByteArray loc1 = R"([
+          {"ID":1, "ObjectType":"Human", "StartTime":1700000010, "EndTime":1700000020,
+           "Attributes":{"Age":"adult", "Gender":1, "Accessories":[1], "UpperColor":[2,3], "LowerColor":[4]},
+           "Trajectory":[{"x":0.1,"y":0.5}, {"x":0.4,"y":0.5}, {"x":0.6,"y":0.5}, {"x":0.9,"y":0.5}],
+           "Thumbnail":[{"image":"body1", "feature":AXIS0}],
+           "FaceThumbnail":[{"image":"face1", "feature":AXIS1, "face_detection_info":{"filtered":0}}]},
+          {"ID":2, "ObjectType":"Human", "StartTime":1700000030, "EndTime":1700000100,
+           "Attributes":{"Gender":2, "UpperColor":[5]},
+           "Trajectory":[{"x":0.45,"y":0.45}, {"x":0.46,"y":0.5}, {"x":0.45,"y":0.55}],
+           "Thumbnail":[{"image":"body2", "feature":AXIS2}],
+           "FaceThumbnail":[{"image":"face2", "feature":AXIS3, "face_detection_info":{"filtered":1}}]},
+          {"ID":3, "ObjectType":"Vehicle", "StartTime":1700000050, "EndTime":1700000060,
+           "Attributes":{"Type":1, "Color":[4], "PlateNumber":"AB123"},
+           "Trajectory":[{"x":0.9,"y":0.9}, {"x":0.95,"y":0.95}], "Thumbnail":[{"image":"body3"}],
+           "LicensePlateThumbnail":[{"image":"plate3", "PlateNumber":"AB123", "detection_info":{"filtered":0}}]},
+          {"ID":9, "ObjectType":"Human", "StartTime":1700005000, "EndTime":1700005001}])";
+        QByteArray loc2 = R"([{"ID":4, "ObjectType":"Human", "StartTime":1700000015, "EndTime":1700000016,
+           "Attributes":{"Gender":1}, "Thumbnail":[{"image":"body4", "feature":AXIS0}]}])";
+        for (int i = 0; i < 4; ++i) {
+            const QByteArray vector = QJsonDocument(axis(i)).toJson(QJsonDocument::Compact);
+            loc1.replace("AXIS" + QByteArray::number(i), vector);
+            loc2.replace("AXIS" + QByteArray::number(i), vector);
         }
-        ASSERT_EQ(store.put(3, crowd), 300);
+        QByteArrayList crowd;
+        for (qint64 i = 0; i < 300; ++i) {
+            crowd.append(QStringLiteral(R"({"ID":%1, "ObjectType":"Human", "StartTime":%2, "EndTime":%2})")
+                             .arg(100 + i)
+                             .arg(T + 1000 + i)
+                             .toUtf8());
+        }
+        ASSERT_EQ(store.put(1, loc1), 4);
+        ASSERT_EQ(store.put(2, loc2), 1);
+        ASSERT_EQ(store.put(3, "[" + crowd.join(',') + "]"), 300);
     }
     static void TearDownTestSuite()
     {
@@ -282,46 +257,38 @@ TEST_F(SearchTest, RequestsFindTheirObjects)
 
 TEST_F(SearchTest, HitsCarryTheStoredFields)
 {
+    // Type, location, times and trajectory are the corpus replay's; here what only a store gives.
     Hits hits;
     worker->query(request({u"Loc1"_s}), hits.worker());
     ASSERT_EQ(hits.ids(), (Ids{1, 2, 3}));
-    const QVariantMap person = hits.progress()[0].toMap();
-    EXPECT_EQ(person.value(KEY_OBJ_TYPE).toString(), "Human");
-    EXPECT_EQ(person.value(KEY_LOC_ID).toString(), "Loc1");
-    EXPECT_EQ(person.value(KEY_START_TIMESTAMP).toLongLong(), (T + 10) * 1000);
-    EXPECT_EQ(person.value(KEY_END_TIMESTAMP).toLongLong(), (T + 20) * 1000);
-    const QVariantList trajectory = person.value(KEY_TRAJECTORY).toList();
-    ASSERT_EQ(trajectory.size(), 4);
-    EXPECT_DOUBLE_EQ(trajectory[1].toMap().value(KEY_X).toDouble(), 0.4);
-    EXPECT_DOUBLE_EQ(trajectory[1].toMap().value(KEY_Y).toDouble(), 0.5);
-    EXPECT_EQ(person.value(KEY_OBJ_IMAGE).toString(), "body1");
-    EXPECT_EQ(person.value(KEY_FEATURE).toList(), axis(0).toVariantList());
-    EXPECT_EQ(person.value(KEY_FACE_IMAGE).toString(), "face1");
-    EXPECT_EQ(person.value(KEY_FACE_FEATURE).toList(), axis(1).toVariantList());
-    EXPECT_EQ(person.value(KEY_OBJECT_AGE).toString(), "adult");
-    EXPECT_EQ(person.value(KEY_OBJECT_GENDER).toInt(), 1);
-    EXPECT_EQ(person.value(KEY_OBJECT_ACCESSORIES).toList(), (QVariantList{1}));
-    EXPECT_EQ(person.value(KEY_OBJECT_UPPER_COLOR).toList(), (QVariantList{2, 3}));
-    EXPECT_EQ(person.value(KEY_OBJECT_LOWER_COLOR).toList(), (QVariantList{4}));
-    EXPECT_EQ(person.value(KEY_OBJECT_VEHICLE_COLOR), QVariant(QVariantList()));
-    EXPECT_EQ(person.value(KEY_OBJECT_VEHICLE_TYPE), QVariant(QString()));
-    EXPECT_EQ(person.size(), 17);
-
-    // A filtered face crop gives neither image nor vector; missing attributes their defaults.
-    const QVariantMap filtered = hits.progress()[1].toMap();
-    EXPECT_FALSE(filtered.contains(KEY_FACE_IMAGE));
-    EXPECT_FALSE(filtered.contains(KEY_FACE_FEATURE));
-    EXPECT_EQ(filtered.value(KEY_OBJECT_AGE), QVariant(QString()));
-    EXPECT_EQ(filtered.value(KEY_OBJECT_ACCESSORIES), QVariant(QVariantList()));
-
-    const QVariantMap vehicle = hits.progress()[2].toMap();
-    EXPECT_EQ(vehicle.value(KEY_OBJ_TYPE).toString(), "Vehicle");
-    EXPECT_EQ(vehicle.value(KEY_PLATE_IMAGE).toString(), "plate3");
-    EXPECT_EQ(vehicle.value(KEY_PLATE_NUMBER).toString(), "AB123");
-    EXPECT_EQ(vehicle.value(KEY_OBJECT_VEHICLE_COLOR).toList(), (QVariantList{4}));
-    EXPECT_EQ(vehicle.value(KEY_OBJECT_VEHICLE_TYPE).toInt(), 1);
-    EXPECT_FALSE(vehicle.value(KEY_FEATURE).isValid());
-    EXPECT_EQ(vehicle.size(), 17);
+    const auto expectFields = [](const QVariant& hit, const QVariantMap& fields) {
+        for (auto it = fields.begin(); it != fields.end(); ++it) {
+            EXPECT_EQ(hit.toMap().value(it.key()), it.value()) << qPrintable(it.key());
+        }
+        EXPECT_EQ(hit.toMap().size(), 17);
+    };
+    expectFields(hits.progress()[0], {{KEY_OBJ_IMAGE, u"body1"_s},
+                                      {KEY_FEATURE, axis(0).toVariantList()},
+                                      {KEY_FACE_IMAGE, u"face1"_s},
+                                      {KEY_FACE_FEATURE, axis(1).toVariantList()},
+                                      {KEY_OBJECT_AGE, u"adult"_s},
+                                      {KEY_OBJECT_GENDER, 1},
+                                      {KEY_OBJECT_ACCESSORIES, QVariantList{1}},
+                                      {KEY_OBJECT_UPPER_COLOR, QVariantList{2, 3}},
+                                      {KEY_OBJECT_LOWER_COLOR, QVariantList{4}},
+                                      {KEY_OBJECT_VEHICLE_COLOR, QVariantList()},
+                                      {KEY_OBJECT_VEHICLE_TYPE, QString()}});
+    expectFields(hits.progress()[2], {{KEY_OBJ_IMAGE, u"body3"_s},
+                                      {KEY_FEATURE, QVariant()},
+                                      {KEY_PLATE_IMAGE, u"plate3"_s},
+                                      {KEY_PLATE_NUMBER, u"AB123"_s},
+                                      {KEY_OBJECT_VEHICLE_COLOR, QVariantList{4}},
+                                      {KEY_OBJECT_VEHICLE_TYPE, 1},
+                                      {KEY_OBJECT_AGE, QString()},
+                                      {KEY_OBJECT_ACCESSORIES, QVariantList()}});
+    // A filtered face crop gives neither image nor vector.
+    EXPECT_FALSE(hits.progress()[1].toMap().contains(KEY_FACE_IMAGE));
+    EXPECT_FALSE(hits.progress()[1].toMap().contains(KEY_FACE_FEATURE));
 }
 
 TEST_F(SearchTest, AtMost201HitsAndFailuresEndWithTheFinalCallOnly)
@@ -518,37 +485,7 @@ TEST_F(RetrieverTest, SearchesRunOneAfterAnotherInArrivalOrder)
     EXPECT_FALSE(retriever->hasNextTask());
 }
 
-TEST_F(RetrieverTest, StopCancelsAQueuedSearchAtOnce)
-{
-    Gate firstHit;
-    Gate proceed;
-    Hits running;
-    running.before = [&](bool finished, const QVariantMap& record) {
-        if (!finished && record.value(KEY_OBJECT_ID).toULongLong() == 100) {
-            firstHit.open();
-            proceed.wait();
-        }
-    };
-    Hits queued;
-    retriever->query(kClientA, crowd(40), running.worker());
-    ASSERT_TRUE(firstHit.wait());
-    retriever->query(kClientB, crowd(40), queued.worker());
-    EXPECT_TRUE(retriever->hasNextTask());
-    retriever->stop(kClientB);
-    // Answered on the stopping thread while the running search is still under way.
-    EXPECT_TRUE(queued.endedOnce());
-    EXPECT_EQ(queued.threads().front(), std::this_thread::get_id());
-    EXPECT_FALSE(retriever->hasNextTask());
-    proceed.open();
-    EXPECT_TRUE(running.waitFinal());
-    EXPECT_EQ(running.ids().size(), 40u);
-    EXPECT_EQ(store->firsts, 1);
-    // A stop for a search that is neither queued nor running does nothing.
-    retriever->stop(kClientB);
-    EXPECT_EQ(queued.finalCount(), 1);
-}
-
-TEST_F(RetrieverTest, StopEndsTheRunningSearchAndTheNextOneStarts)
+TEST_F(RetrieverTest, StopCancelsAQueuedSearchAtOnceAndEndsTheRunningOne)
 {
     Gate secondHit;
     Gate proceed;
@@ -560,21 +497,28 @@ TEST_F(RetrieverTest, StopEndsTheRunningSearchAndTheNextOneStarts)
         }
     };
     Hits sameClient;
-    Hits otherClient;
+    Hits cancelled;
     retriever->query(kClientA, crowd(300), running.worker());
     ASSERT_TRUE(secondHit.wait());
-    // A new search of the running client waits behind it; the running one goes on.
     retriever->query(kClientA, crowd(300), sameClient.worker());
-    retriever->query(kClientB, crowd(300), otherClient.worker());
+    retriever->query(kClientB, crowd(300), cancelled.worker());
+    // A queued search is answered on the stopping thread while the running one is under way.
+    retriever->stop(kClientB);
+    EXPECT_TRUE(cancelled.endedOnce());
+    EXPECT_EQ(cancelled.threads().front(), std::this_thread::get_id());
+    EXPECT_TRUE(retriever->hasNextTask());
+    // The running search ends at its next check; the queued one of the same client is not
+    // cancelled and runs next, in full.
     retriever->stop(kClientA);
     proceed.open();
-    EXPECT_TRUE(otherClient.waitFinal());
-    // Ended at the next check after the stop; the queued search of the same client was not
-    // cancelled: it runs next, in full, then the other client's.
+    EXPECT_TRUE(sameClient.waitFinal());
     EXPECT_EQ(running.ids().size(), 2u);
     EXPECT_TRUE(running.endedOnce());
     EXPECT_EQ(sameClient.ids().size(), 201u);
-    EXPECT_EQ(otherClient.ids().size(), 201u);
+    EXPECT_EQ(store->firsts, 2);
+    // A stop for a search that is neither queued nor running does nothing.
+    retriever->stop(kClientB);
+    EXPECT_EQ(cancelled.finalCount(), 1);
 }
 
 TEST_F(RetrieverTest, LateStopNeverEndsTheFollowingSearch)

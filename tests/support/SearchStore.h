@@ -6,10 +6,6 @@
 
 #include "TamsaWrapper.h"
 
-#include <QJsonArray>
-#include <QJsonDocument>
-#include <QJsonObject>
-
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
@@ -25,13 +21,12 @@ public:
     {}
     QString getStoragesDBPath() override { return m_folder; }
 
-    // Stores one camera answer ({"ObjectMetaInfo": objects}) under `location`; the count stored.
-    int put(int location, const QJsonArray& objects)
+    // Stores the objects of one camera answer (a JSON array) under `location`; the count stored.
+    int put(int location, const QByteArray& objects)
     {
         void* database = nullptr;
         initDatabase(&database);
-        const QByteArray answer = QJsonDocument(QJsonObject{{QStringLiteral("ObjectMetaInfo"), objects}})
-                                      .toJson(QJsonDocument::Compact);
+        const QByteArray answer = "{\"ObjectMetaInfo\":" + objects + "}";
         const int stored = Tamsa_PutObjectMetaInfo(database, 1, location, answer.constData());
         releaseDatabase(&database);
         return stored;

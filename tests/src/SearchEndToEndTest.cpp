@@ -73,8 +73,13 @@ protected:
         plugin.InitialPluginBase(nullptr);
     }
 
-    std::vector<QVariantMap> run(const QString& command, const QVariantMap& params)
+    // The whole seeded span at `locations`, with the conditions of `params`.
+    std::vector<QVariantMap> run(const QString& command, const QStringList& locations,
+                                 QVariantMap params = {})
     {
+        params.insert(KEY_LOC_ID_LIST, locations);
+        params.insert(KEY_START_TIMESTAMP, qint64(s_options.firstTime) * 1000);
+        params.insert(KEY_END_TIMESTAMP, (qint64(s_options.firstTime) + s_options.spanSeconds + 3600) * 1000);
         ReplyRecorder replies;
         RequestSenderInfo sender;
         sender.senderHandle = &g_client;
@@ -88,19 +93,9 @@ protected:
         return hits;
     }
 
-    static qint64 windowStartMs() { return qint64(s_options.firstTime) * 1000; }
-    static qint64 windowEndMs()
-    {
-        return (qint64(s_options.firstTime) + s_options.spanSeconds + 3600) * 1000;
-    }
-
     static QVariantList asList(const std::vector<float>& vector)
     {
-        QVariantList list;
-        for (float value : vector) {
-            list.append(double(value));
-        }
-        return list;
+        return QVariantList(vector.begin(), vector.end());
     }
 
     static QTemporaryDir* s_data;
@@ -115,9 +110,7 @@ tamsa::TamsaSeedOptions SearchEndToEndTest::s_options;
 
 TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrder)
 {
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc2"}},
-                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
-                                                                 {KEY_END_TIMESTAMP, windowEndMs()}});
+    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc2"});
     ASSERT_EQ(hits.size(), 201u);
     qint64 previous = 0;
     std::set<qulonglong> ids;
@@ -157,10 +150,7 @@ TEST_F(SearchEndToEndTest, PlateSearchFindsThatVehicle)
         }
     }
     ASSERT_FALSE(plate.isEmpty());
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc3"}},
-                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
-                                                                 {KEY_END_TIMESTAMP, windowEndMs()},
-                                                                 {KEY_PLATE_NUMBER, plate}});
+    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc3"}, {{KEY_PLATE_NUMBER, plate}});
     ASSERT_FALSE(hits.empty());
     bool found = false;
     for (const QVariantMap& hit : hits) {
@@ -185,16 +175,9 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
     }
     ASSERT_GT(expected.size(), 5u);
 
-    QStringList locations;
-    for (uint32_t location = 1; location <= s_options.locations; ++location) {
-        locations.append(QStringLiteral("Loc%1").arg(location));
-    }
-    const std::vector<QVariantMap> hits =
-        run(CMD_START_REID_SEARCH, {{KEY_LOC_ID_LIST, locations},
-                                    {KEY_START_TIMESTAMP, windowStartMs()},
-                                    {KEY_END_TIMESTAMP, windowEndMs()},
-                                    {KEY_FEATURE, asList(seeder.identityBody(identity))},
-                                    {KEY_FACE_FEATURE, asList(seeder.identityFace(identity))}});
+    const std::vector<QVariantMap> hits = run(CMD_START_REID_SEARCH, {"Loc1", "Loc2", "Loc3", "Loc4"},
+                                              {{KEY_FEATURE, asList(seeder.identityBody(identity))},
+                                               {KEY_FACE_FEATURE, asList(seeder.identityFace(identity))}});
     std::set<std::pair<QString, qulonglong>> found;
     for (const QVariantMap& hit : hits) {
         EXPECT_EQ(hit.value(KEY_OBJ_TYPE).toString(), "Human");
@@ -224,16 +207,10 @@ TEST_F(SearchEndToEndTest, DISABLED_ReadOnlyStoreInThisProcess)
     }
     ASSERT_NE(::access((store + "/tamsa.db").constData(), W_OK), 0) << "the store is still writable";
 
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc2"}},
-                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
-                                                                 {KEY_END_TIMESTAMP, windowEndMs()}});
-    EXPECT_EQ(hits.size(), 201u);
+    EXPECT_EQ(run(CMD_START_SEARCH, {"Loc2"}).size(), 201u);
     const tamsa::TamsaSeeder seeder(s_options);
     const uint32_t identity = seeder.identityOf(1, 0) == 0 ? 1 : seeder.identityOf(1, 0);
-    const std::vector<QVariantMap> sightings =
-        run(CMD_START_REID_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc1", "Loc2"}},
-                                    {KEY_START_TIMESTAMP, windowStartMs()},
-                                    {KEY_END_TIMESTAMP, windowEndMs()},
-                                    {KEY_FEATURE, asList(seeder.identityBody(identity))}});
-    EXPECT_FALSE(sightings.empty());
+    EXPECT_FALSE(
+        run(CMD_START_REID_SEARCH, {"Loc1", "Loc2"}, {{KEY_FEATURE, asList(seeder.identityBody(identity))}})
+            .empty());
 }

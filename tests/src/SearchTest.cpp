@@ -332,7 +332,7 @@ TEST_F(SearchTest, ReIdSearchesEveryLocationOnItsOwn)
     Hits serial;
     worker->reId(params, serial.worker());
     // In list order, the person conditions ignored, on the calling thread; scores as the store gave them.
-    EXPECT_EQ(serial.ids(), (Ids{4, 1}));
+    ASSERT_EQ(serial.ids(), (Ids{4, 1}));
     EXPECT_TRUE(serial.endedOnce());
     for (const std::thread::id& thread : serial.threads()) {
         EXPECT_EQ(thread, std::this_thread::get_id());

@@ -88,7 +88,10 @@ struct Gate
     std::promise<void> opened;
     std::shared_future<void> future = opened.get_future().share();
     void open() { opened.set_value(); }
-    bool wait() { return future.wait_for(std::chrono::seconds(10)) == std::future_status::ready; }
+    bool wait()
+    {
+        return future.wait_for(std::chrono::milliseconds(scaledMs(10000))) == std::future_status::ready;
+    }
 };
 
 QVariantMap request(const QStringList& locations, const QVariantMap& extra = {})

@@ -5,6 +5,7 @@
 // Header-only; tests that use it link the plug-in core.
 
 #include "TamsaWrapper.h"
+#include "TestWait.h"
 
 #include <atomic>
 #include <chrono>
@@ -51,11 +52,12 @@ public:
         std::lock_guard<std::mutex> lock(m_mutex);
         return int(m_open.size());
     }
-    // Waits (up to 10 s) until `count` searches are inside a held Next.
+    // Waits (up to 10 s, scaled) until `count` searches are inside a held Next.
     bool waitHeld(int count)
     {
         std::unique_lock<std::mutex> lock(m_mutex);
-        return m_changed.wait_for(lock, std::chrono::seconds(10), [&] { return m_held >= count; });
+        return m_changed.wait_for(lock, std::chrono::milliseconds(scaledMs(10000)),
+                                  [&] { return m_held >= count; });
     }
 
     long initDatabase(void** database) override

@@ -1,88 +1,29 @@
 // Both searches through Request over the real store library, seeded with synthetic camera
 // answers, found the way production finds it: through the machine setting "INSTALL_PATH".
 #include "DelvixKeys.h"
-#include "ICameraInformationCollector.h"
+#include "Faults.h"
+#include "HostFakes.h"
 #include "PluginDelvixSrv.h"
+#include "ReplyRecorder.h"
 #include "Tamsa.h"
 #include "TamsaSeeder.h"
 #include "TamsaWrapper.h"
 
-#include <QCoreApplication>
 #include <QDir>
 #include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
-#include <QProcess>
 #include <QSettings>
 #include <QTemporaryDir>
 
 #include <gtest/gtest.h>
 
-#include <cerrno>
-#include <chrono>
-#include <condition_variable>
-#include <cstring>
-#include <mutex>
-#include <sched.h>
 #include <set>
-#include <sys/mount.h>
 #include <unistd.h>
 
 namespace {
 
 int g_client = 0;
-
-// The camera directory is not what these tests are about: a fixed one, location n on camera-n.
-class FixedDirectory : public ICameraInformationCollector
-{
-public:
-    void writeData(int, int, const QString&) override {}
-    void setDelvixSettings(const QVariantMap&) override {}
-    QString getCameraNodeID(const QString& location) override
-    {
-        return QString(location).replace(QStringLiteral("Loc"), QStringLiteral("camera-"));
-    }
-};
-
-class Replies
-{
-public:
-    HDLR_DO_REQUEST_CB callback()
-    {
-        return [this](bool bFinal, const QString& code, const QString&, const QVariant& payload) {
-            std::lock_guard<std::mutex> lock(m_mutex);
-            if (bFinal) {
-                m_finalCode = code;
-                m_done = true;
-                m_changed.notify_all();
-            } else {
-                m_hits.push_back(payload.toMap());
-            }
-        };
-    }
-    bool wait()
-    {
-        std::unique_lock<std::mutex> lock(m_mutex);
-        return m_changed.wait_for(lock, std::chrono::seconds(60), [this] { return m_done; });
-    }
-    std::vector<QVariantMap> hits()
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        return m_hits;
-    }
-    QString finalCode()
-    {
-        std::lock_guard<std::mutex> lock(m_mutex);
-        return m_finalCode;
-    }
-
-private:
-    std::mutex m_mutex;
-    std::condition_variable m_changed;
-    std::vector<QVariantMap> m_hits;
-    QString m_finalCode;
-    bool m_done = false;
-};
 
 class SearchEndToEndTest : public ::testing::Test
 {
@@ -122,34 +63,39 @@ protected:
 
     void SetUp() override
     {
-        plugin.setCameraInformationCollector(QSharedPointer<FixedDirectory>::create());
+        // The camera directory is not what these tests are about: location n on camera-n.
+        auto directory = QSharedPointer<FakeCollector>::create();
+        for (uint32_t location = 1; location <= s_options.locations; ++location) {
+            directory->cameras.insert(QStringLiteral("Loc%1").arg(location),
+                                      QStringLiteral("camera-%1").arg(location));
+        }
+        plugin.setCameraInformationCollector(directory);
         plugin.InitialPluginBase(nullptr);
     }
 
-    std::vector<QVariantMap> run(const QString& command, const QVariantMap& params)
+    // The whole seeded span at `locations`, with the conditions of `params`.
+    std::vector<QVariantMap> run(const QString& command, const QStringList& locations,
+                                 QVariantMap params = {})
     {
-        Replies replies;
+        params.insert(KEY_LOC_ID_LIST, locations);
+        params.insert(KEY_START_TIMESTAMP, qint64(s_options.firstTime) * 1000);
+        params.insert(KEY_END_TIMESTAMP, (qint64(s_options.firstTime) + s_options.spanSeconds + 3600) * 1000);
+        ReplyRecorder replies;
         RequestSenderInfo sender;
         sender.senderHandle = &g_client;
         plugin.Request(command, params, sender, replies.callback());
-        EXPECT_TRUE(replies.wait());
-        EXPECT_EQ(replies.finalCode(), RC_SUCCESS);
-        return replies.hits();
-    }
-
-    static qint64 windowStartMs() { return qint64(s_options.firstTime) * 1000; }
-    static qint64 windowEndMs()
-    {
-        return (qint64(s_options.firstTime) + s_options.spanSeconds + 3600) * 1000;
+        EXPECT_TRUE(replies.waitFinal(60000));
+        EXPECT_EQ(replies.last().code, RC_SUCCESS);
+        std::vector<QVariantMap> hits;
+        for (const QVariant& hit : replies.progress()) {
+            hits.push_back(hit.toMap());
+        }
+        return hits;
     }
 
     static QVariantList asList(const std::vector<float>& vector)
     {
-        QVariantList list;
-        for (float value : vector) {
-            list.append(double(value));
-        }
-        return list;
+        return QVariantList(vector.begin(), vector.end());
     }
 
     static QTemporaryDir* s_data;
@@ -164,9 +110,7 @@ tamsa::TamsaSeedOptions SearchEndToEndTest::s_options;
 
 TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrder)
 {
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc2"}},
-                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
-                                                                 {KEY_END_TIMESTAMP, windowEndMs()}});
+    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc2"});
     ASSERT_EQ(hits.size(), 201u);
     qint64 previous = 0;
     std::set<qulonglong> ids;
@@ -206,10 +150,7 @@ TEST_F(SearchEndToEndTest, PlateSearchFindsThatVehicle)
         }
     }
     ASSERT_FALSE(plate.isEmpty());
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc3"}},
-                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
-                                                                 {KEY_END_TIMESTAMP, windowEndMs()},
-                                                                 {KEY_PLATE_NUMBER, plate}});
+    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc3"}, {{KEY_PLATE_NUMBER, plate}});
     ASSERT_FALSE(hits.empty());
     bool found = false;
     for (const QVariantMap& hit : hits) {
@@ -234,16 +175,9 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
     }
     ASSERT_GT(expected.size(), 5u);
 
-    QStringList locations;
-    for (uint32_t location = 1; location <= s_options.locations; ++location) {
-        locations.append(QStringLiteral("Loc%1").arg(location));
-    }
-    const std::vector<QVariantMap> hits =
-        run(CMD_START_REID_SEARCH, {{KEY_LOC_ID_LIST, locations},
-                                    {KEY_START_TIMESTAMP, windowStartMs()},
-                                    {KEY_END_TIMESTAMP, windowEndMs()},
-                                    {KEY_FEATURE, asList(seeder.identityBody(identity))},
-                                    {KEY_FACE_FEATURE, asList(seeder.identityFace(identity))}});
+    const std::vector<QVariantMap> hits = run(CMD_START_REID_SEARCH, {"Loc1", "Loc2", "Loc3", "Loc4"},
+                                              {{KEY_FEATURE, asList(seeder.identityBody(identity))},
+                                               {KEY_FACE_FEATURE, asList(seeder.identityFace(identity))}});
     std::set<std::pair<QString, qulonglong>> found;
     for (const QVariantMap& hit : hits) {
         EXPECT_EQ(hit.value(KEY_OBJ_TYPE).toString(), "Human");
@@ -257,46 +191,26 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
 // The mounts stay in a second process of this program: it runs the disabled test below.
 TEST(SearchEndToEndReadOnly, SearchesAnswerFromAReadOnlyStore)
 {
-    QProcess child;
-    child.setProcessChannelMode(QProcess::MergedChannels);
-    child.start(QCoreApplication::applicationFilePath(),
-                {QStringLiteral("--gtest_also_run_disabled_tests"),
-                 QStringLiteral("--gtest_filter=SearchEndToEndTest.DISABLED_ReadOnlyStoreInThisProcess")});
-    ASSERT_TRUE(child.waitForFinished(240000));
-    const QByteArray output = child.readAll();
-    if (output.contains("[  SKIPPED ] 1 test")) {
-        GTEST_SKIP() << output.constData();
-    }
-    EXPECT_EQ(child.exitStatus(), QProcess::NormalExit) << output.constData();
-    EXPECT_EQ(child.exitCode(), 0) << output.constData();
-    EXPECT_TRUE(output.contains("[  PASSED  ] 1 test")) << output.constData();
+    runDisabledTestInChild("SearchEndToEndTest.DISABLED_ReadOnlyStoreInThisProcess", 240000);
 }
 
 TEST_F(SearchEndToEndTest, DISABLED_ReadOnlyStoreInThisProcess)
 {
-    // The store folder becomes a read-only view of itself in a mount namespace of this process
-    // (chmod binds nobody when the tests run as root).
+    // The store folder becomes a read-only view of itself (chmod binds nobody when the tests run as root).
     const QByteArray store = QDir(s_data->path()).filePath(QStringLiteral("Server")).toUtf8();
-    if (::unshare(CLONE_NEWNS) != 0) {
-        GTEST_SKIP() << "no mount namespace: " << std::strerror(errno);
+    std::string reason = enterPrivateMountNamespace();
+    if (reason.empty()) {
+        reason = bindReadOnly(store.toStdString());
     }
-    ASSERT_EQ(::mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr), 0) << std::strerror(errno);
-    ASSERT_EQ(::mount(store.constData(), store.constData(), nullptr, MS_BIND, nullptr), 0)
-        << std::strerror(errno);
-    ASSERT_EQ(::mount(nullptr, store.constData(), nullptr, MS_REMOUNT | MS_BIND | MS_RDONLY, nullptr), 0)
-        << std::strerror(errno);
+    if (!reason.empty()) {
+        GTEST_SKIP() << reason;
+    }
     ASSERT_NE(::access((store + "/tamsa.db").constData(), W_OK), 0) << "the store is still writable";
 
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc2"}},
-                                                                 {KEY_START_TIMESTAMP, windowStartMs()},
-                                                                 {KEY_END_TIMESTAMP, windowEndMs()}});
-    EXPECT_EQ(hits.size(), 201u);
+    EXPECT_EQ(run(CMD_START_SEARCH, {"Loc2"}).size(), 201u);
     const tamsa::TamsaSeeder seeder(s_options);
     const uint32_t identity = seeder.identityOf(1, 0) == 0 ? 1 : seeder.identityOf(1, 0);
-    const std::vector<QVariantMap> sightings =
-        run(CMD_START_REID_SEARCH, {{KEY_LOC_ID_LIST, QStringList{"Loc1", "Loc2"}},
-                                    {KEY_START_TIMESTAMP, windowStartMs()},
-                                    {KEY_END_TIMESTAMP, windowEndMs()},
-                                    {KEY_FEATURE, asList(seeder.identityBody(identity))}});
-    EXPECT_FALSE(sightings.empty());
+    EXPECT_FALSE(
+        run(CMD_START_REID_SEARCH, {"Loc1", "Loc2"}, {{KEY_FEATURE, asList(seeder.identityBody(identity))}})
+            .empty());
 }

@@ -2,10 +2,8 @@
 // "InputObjectMetaInfo" text that writeData sends.
 #include "CameraInformationCollector.h"
 #include "HostFakes.h"
-#include "Quellon.h"
 #include "ScriptedTunnelClient.h"
 
-#include <QJsonDocument>
 #include <QThread>
 #include <atomic>
 #include <gtest/gtest.h>
@@ -199,7 +197,7 @@ TEST_F(CollectorTest, LocationLookupFollowsEveryChangeAndServesOtherThreads)
     EXPECT_EQ(wrong.load(), 0);
 }
 
-TEST_F(CollectorTest, WriteDataSendsTheObjectsWithIdRangeAndFilteredThumbnails)
+TEST_F(CollectorTest, WriteDataSendsTheObjectsWithIdRangeFilteredThumbnailsAndSafeText)
 {
     collector->setDelvixSettings(QVariantMap{{u"faceEnable"_s, false}, {u"LPREnable"_s, true}});
     const QString body = QStringLiteral(
@@ -224,59 +222,25 @@ TEST_F(CollectorTest, WriteDataSendsTheObjectsWithIdRangeAndFilteredThumbnails)
     collector->writeData(1, 1, body);
     EXPECT_FALSE(sentInfo().contains(u"Thumbnail\""_s));
 
-    // Nothing goes out without objects.
-    const int sent = client.requests.size();
-    for (const QString& none :
-         {QString(), u"not json"_s, uR"({"ObjectMetaInfo":[]})"_s, uR"({"ObjectMetaInfo":{"ID":1}})"_s,
-          uR"({"Other":[1]})"_s, uR"([{"ObjectMetaInfo":[{"ID":1}]}])"_s,
-          uR"({"ObjectMetaInfo":[{"ID":1}])"_s}) {
-        collector->writeData(1, 1, none);
-    }
-    EXPECT_EQ(client.requests.size(), sent);
-}
-
-TEST_F(CollectorTest, WriteDataKeepsTextSafeAndIntact)
-{
-    struct Row
-    {
-        QString body;
-        QString info; // what goes inside <Info>
-        const char* range;
-    };
-    const std::vector<Row> rows{
-        // Markup is escaped, "%1" is data, non-ASCII text survives.
-        {uR"({"ObjectMetaInfo":[{"ID":10000000000,"P":"京A<b>&%1"}]})"_s,
-         uR"({"ObjectMetaInfo":[{"ID":10000000000,"P":"京A&lt;b&gt;&amp;%1"}]})"_s,
-         "<StartTime>10000000000</StartTime><EndTime>10000000000</EndTime>"},
+    // Markup is escaped, "%1" is data, non-ASCII text survives, text without markup is the compact
+    // JSON byte for byte, characters XML does not allow at all go out as their JSON escapes, and
+    // IDs are 64 bits wide. (The fuzz target checks that every text reads back as sent.)
+    const QString rows[][2] = {
+        {uR"({"ObjectMetaInfo":[{"ID":1,"P":"京A<b>&%1"}]})"_s,
+         uR"({"ObjectMetaInfo":[{"ID":1,"P":"京A&lt;b&gt;&amp;%1"}]})"_s},
         {uR"({"ObjectMetaInfo":[{"ID":1,"P":"<x>"}]})"_s,
-         uR"({"ObjectMetaInfo":[{"ID":1,"P":"&lt;x&gt;"}]})"_s, "<StartTime>1</StartTime>"},
-        // Text without markup is the compact JSON, byte for byte.
-        {uR"({"ObjectMetaInfo":[{"ID":1, "Name":"Zoë"}]})"_s,
-         uR"({"ObjectMetaInfo":[{"ID":1,"Name":"Zoë"}]})"_s, ""},
-        // Characters XML does not allow at all go out as their JSON escapes.
+         uR"({"ObjectMetaInfo":[{"ID":1,"P":"&lt;x&gt;"}]})"_s},
+        {uR"({"ObjectMetaInfo":[{"ID":1, "P":"Zoë"}]})"_s, uR"({"ObjectMetaInfo":[{"ID":1,"P":"Zoë"}]})"_s},
         {u"{\"ObjectMetaInfo\":[{\"ID\":1,\"N\":\"a\uFFFFb\uFFFE\"}]}"_s,
-         uR"({"ObjectMetaInfo":[{"ID":1,"N":"a\uffffb\ufffe"}]})"_s, ""},
-        // An object without ID (or not an object at all) reads as 0 and goes out with ID null.
-        {uR"({"ObjectMetaInfo":[{"ID":4},{"X":1},7]})"_s,
-         uR"({"ObjectMetaInfo":[{"ID":4},{"ID":null,"X":1},{"ID":null}]})"_s,
-         "<StartTime>0</StartTime><EndTime>4</EndTime>"},
+         uR"({"ObjectMetaInfo":[{"ID":1,"N":"a\uffffb\ufffe"}]})"_s},
+        {uR"({"ObjectMetaInfo":[{"ID":10000000000}]})"_s, uR"({"ObjectMetaInfo":[{"ID":10000000000}]})"_s},
     };
-    Quellon quellon;
-    for (const Row& row : rows) {
-        collector->writeData(-1, -2, row.body);
-        const QString sent = sentMetaInfo()->info.strContent;
-        EXPECT_EQ(sentInfo(), row.info) << qPrintable(row.body);
-        EXPECT_TRUE(sent.contains(QString::fromUtf8(row.range))) << qPrintable(sent);
-        EXPECT_TRUE(
-            sent.startsWith(u"<InputObjectMetaInfo><GroupID>-1</GroupID><LocationID>-2</LocationID>"_s));
-        // What the server reads back is the objects sent.
-        const QString readBack =
-            quellon.parse(sent).toMap().value(u"InputObjectMetaInfo"_s).toMap().value(u"Info"_s).toString();
-        QString unescaped = row.info;
-        unescaped.replace(u"&lt;"_s, u"<"_s).replace(u"&gt;"_s, u">"_s).replace(u"&amp;"_s, u"&"_s);
-        EXPECT_EQ(QJsonDocument::fromJson(readBack.toUtf8()), QJsonDocument::fromJson(unescaped.toUtf8()))
-            << qPrintable(sent);
+    for (const auto& [body, info] : rows) {
+        collector->writeData(-1, -2, body);
+        EXPECT_EQ(sentInfo(), info) << qPrintable(body);
     }
+    EXPECT_TRUE(sentMetaInfo()->info.strContent.startsWith(
+        u"<InputObjectMetaInfo><GroupID>-1</GroupID><LocationID>-2</LocationID><StartTime>10000000000</StartTime>"_s));
 }
 
 TEST(CollectorWithHastyClient, AnswersArrivingDuringConstructionAreNotLost)

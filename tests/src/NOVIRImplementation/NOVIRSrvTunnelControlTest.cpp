@@ -76,85 +76,56 @@ protected:
         QObject::connect(c, &NOVIRSrvTunnelControl::updateCameraStatus, c, [=](const QString& name, bool on) {
             log(u"status "_s + name + (on ? u" on"_s : u" off"_s));
         });
-        QObject::connect(c, &NOVIRSrvTunnelControl::reqResp, c,
-                         [=](bool success, bool finish, const QString& text, const QString& relay,
-                             void* context, const QString& code) {
-                             log(u"reply %1 %2 %3 %4 %5"_s.arg(success).arg(finish).arg(text, relay, code));
-                             lastContext = context;
-                         });
         client.onInsert = [this](int i) {
             events << u"sent "_s + client.requests.at(i).cmdName + u' ' +
                           client.requests.at(i).info.strContent;
         };
     }
     // The map announced for one answer on a new connection ("(none)" when nothing was announced).
-    QVariantMap lastCameras(const QString& answer)
+    template <typename Signal>
+    QVariantMap announced(Signal signal, NSNovirTunnelClient::ServerType server, const QString& answer)
     {
         QVariantMap result{{u"(none)"_s, 0}};
-        auto connection = QObject::connect(control.get(), &NOVIRSrvTunnelControl::updateCameras,
-                                           control.get(), [&](const QVariantMap& map) { result = map; });
-        client.connectServer(ConfigServer);
-        client.answer(client.lastRequest(u"GetNodeInfo"_s), true, u"0"_s, answer);
+        auto connection = QObject::connect(control.get(), signal, control.get(),
+                                           [&](const QVariantMap& map) { result = map; });
+        client.connectServer(server);
+        client.answer(client.lastRequest(server == ConfigServer ? u"GetNodeInfo"_s : u"QryLocs"_s), true,
+                      u"0"_s, answer);
         QObject::disconnect(connection);
         return result;
     }
+    QVariantMap lastCameras(const QString& answer)
+    {
+        return announced(&NOVIRSrvTunnelControl::updateCameras, ConfigServer, answer);
+    }
     QVariantMap lastLocations(const QString& answer)
     {
-        QVariantMap result{{u"(none)"_s, 0}};
-        auto connection = QObject::connect(control.get(), &NOVIRSrvTunnelControl::updateLocations,
-                                           control.get(), [&](const QVariantMap& map) { result = map; });
-        client.connectServer(LocationServer);
-        client.answer(client.lastRequest(u"QryLocs"_s), true, u"0"_s, answer);
-        QObject::disconnect(connection);
-        return result;
+        return announced(&NOVIRSrvTunnelControl::updateLocations, LocationServer, answer);
     }
     QStringList take() { return std::exchange(events, {}); }
 
     ScriptedTunnelClient client; // outlives the control, as the host's client does
     std::unique_ptr<NOVIRSrvTunnelControl> control;
     QStringList events;
-    void* lastContext = nullptr;
 };
 
 } // namespace
 
-TEST(TunnelControlWithoutClient, EveryOperationFailsQuietly)
-{
-    NOVIRSrvTunnelControl control(nullptr);
-    EXPECT_FALSE(control.sendRequest(nullptr, u"X"_s, QString(), QString(), nullptr, ConfigServer));
-    EXPECT_EQ(control.getServerAccountID(), nullptr);
-    EXPECT_FALSE(control.registerBroadcastHandler(nullptr));
-    EXPECT_FALSE(control.registerEventHandler(nullptr, u"E"_s, ConfigServer));
-}
-
 TEST_F(TunnelControlTest, EachConnectionStartsItsWork)
 {
-    ASSERT_EQ(client.connectRegistrations.size(), 1);
-    EXPECT_TRUE(client.broadcastRegistrations.isEmpty());
     client.connectServer(ConfigServer, false);
     client.connectServer(LocationServer, false);
     client.connectServer(static_cast<NSNovirTunnelClient::ServerType>(2));
     EXPECT_TRUE(take().isEmpty());
 
     client.connectServer(ConfigServer);
-    QStringList broadcasts;
-    for (const auto& registration : client.broadcastRegistrations) {
-        EXPECT_EQ(registration.type, ConfigServer);
-        broadcasts << registration.name;
-    }
-    EXPECT_EQ(broadcasts,
-              (QStringList{u"CamIns"_s, u"CamRmv"_s, u"CamInfoChange"_s, u"ChannelAdd"_s, u"ChannelRmv"_s}));
     client.connectServer(LocationServer);
+    EXPECT_EQ(client.broadcastRegistrations.size(), 5);
     EXPECT_EQ(take(), (QStringList{u"sent GetNodeInfo <GetNodeInfo><Node>__allcams__</Node></GetNodeInfo>"_s,
                                    u"sent SubCamStatus <SubCamStatus><SID>srv-1</SID></SubCamStatus>"_s,
                                    u"sent QryLocs <QryLocs><LiveOnly>false</LiveOnly></QryLocs>"_s}));
     EXPECT_EQ(client.requests.at(1).serverId, u"srv-1"_s);
-    EXPECT_TRUE(client.requests.at(1).subscribe);
     EXPECT_EQ(client.requests.at(2).type, LocationServer);
-    for (const auto& request : client.requests) {
-        EXPECT_EQ(request.pluginId, client.connectRegistrations.first().pluginId);
-        EXPECT_EQ(request.clientID, &client.account);
-    }
 
     // A new connection repeats the steps; the server id is escaped in the text, passed on as it is.
     client.serverId = u"a<b>&c"_s;
@@ -163,70 +134,42 @@ TEST_F(TunnelControlTest, EachConnectionStartsItsWork)
     EXPECT_EQ(client.requests.last().serverId, u"a<b>&c"_s);
 }
 
-TEST_F(TunnelControlTest, NodeInfoParserKeepsRecordingCamerasWithTheirConnectionRules)
+TEST_F(TunnelControlTest, ParsersKeepRecordingCamerasWithTheirConnectionRulesAndEveryLocationList)
 {
+    // The records' values for the "camera.key" of each "camera.key=value" in expected ('-': none).
+    auto valuesFor = [](const QVariantMap& records, const QString& expected) {
+        QStringList result;
+        for (const QString& field : expected.split(u' ')) {
+            const QString name = field.section(u'=', 0, 0);
+            const QVariant value =
+                records.value(name.section(u'.', 0, 0)).toMap().value(name.section(u'.', 1));
+            result << name + u'=' + (value.isValid() ? value.toString() : u"-"_s);
+        }
+        return result.join(u' ');
+    };
     const QVariantMap cameras = lastCameras(readData("nodeinfo_edge_cases.xml"));
-    EXPECT_EQ(cameras.keys(),
-              (QStringList{u"Dup"_s, u"HostileChannel"_s, u"Multi0"_s, u"Multi3"_s, u"MultiNoChannel"_s,
-                           u"Plain"_s, u"SingleChannel"_s, u"Sparse"_s, u"SslNoPort"_s, u"SslWithPort"_s}));
-    // SSL off: HTTPSPort ignored; the password stays hexadecimal.
-    EXPECT_EQ(cameras.value(u"Plain"_s), QVariant(QVariantMap{{u"Name"_s, u"Plain"_s},
-                                                              {u"IP"_s, u"127.0.0.1"_s},
-                                                              {u"Port"_s, 8080},
-                                                              {u"UseSSL"_s, false},
-                                                              {u"User"_s, u"admin"_s},
-                                                              {u"Password"_s, u"736563726574"_s},
-                                                              {u"DelvixProtect"_s, false}}));
-    struct Row
-    {
-        const char* camera;
-        const char* key;
-        QVariant expected; // invalid: the record has no such value
-    };
-    const std::vector<Row> rows{
-        {"SslWithPort", "Port", 8443},
-        {"SslWithPort", "UseSSL", true},
-        {"SslWithPort", "DelvixProtect", true},
-        {"SslNoPort", "Port", 443},
-        {"SslNoPort", "DelvixProtect", false},
-        {"Multi3", "MultiChannelID", 2},
-        {"Multi0", "MultiChannelID", 0},
-        {"MultiNoChannel", "MultiChannelID", 0},
-        {"HostileChannel", "MultiChannelID", 0},
-        {"SingleChannel", "MultiChannelID", {}},
-        {"Dup", "Port", 2},
-        {"Sparse", "IP", {}},
-        {"Sparse", "Password", {}},
-        {"Sparse", "Port", 0},
-    };
-    for (const Row& row : rows) {
-        EXPECT_EQ(cameras.value(QLatin1String(row.camera)).toMap().value(QLatin1String(row.key)),
-                  row.expected)
-            << row.camera << "." << row.key;
-    }
-
-    // One camera alone; elements where texts belong and texts where elements belong.
+    EXPECT_EQ(
+        cameras.keys().join(u' '),
+        u"Dup HostileChannel Multi0 Multi3 MultiNoChannel Plain SingleChannel Sparse SslNoPort SslWithPort"_s);
+    // SSL off: HTTPSPort ignored; the password stays hexadecimal; a later duplicate wins; a channel
+    // number counts from 1 and never goes below 0.
+    const QString expected =
+        u"Plain.IP=127.0.0.1 Plain.Port=8080 Plain.UseSSL=false Plain.User=admin Plain.Password=736563726574 "
+        "Plain.DelvixProtect=false Plain.MultiChannelID=- SslWithPort.Port=8443 SslWithPort.UseSSL=true "
+        "SslWithPort.DelvixProtect=true SslNoPort.Port=443 SslNoPort.DelvixProtect=false "
+        "Multi3.MultiChannelID=2 "
+        "Multi0.MultiChannelID=0 MultiNoChannel.MultiChannelID=0 HostileChannel.MultiChannelID=0 "
+        "SingleChannel.MultiChannelID=- Dup.Port=2 Sparse.IP=- Sparse.Password=- Sparse.Port=0"_s;
+    EXPECT_EQ(valuesFor(cameras, expected), expected);
+    EXPECT_EQ(cameras.value(u"Plain"_s).toMap().size(), 7);
     EXPECT_EQ(lastCameras(nodeInfo({camXml(u"Only"_s, 18081)})).value(u"Only"_s).toMap().value(u"Port"_s),
               18081);
-    const QVariantMap odd = lastCameras(
-        u"<NodeInfo><Cameras><Cam><Name>N</Name><IP><Deep>x</Deep></IP><User>a</User><User>b</User>"
-        "<ObjectMetaRecordCap>true</ObjectMetaRecordCap></Cam><Cam>text</Cam></Cameras></NodeInfo>"_s);
-    ASSERT_EQ(odd.keys(), QStringList{u"N"_s});
-    EXPECT_EQ(odd.value(u"N"_s).toMap().value(u"IP"_s).typeId(), QMetaType::QString);
-    EXPECT_EQ(odd.value(u"N"_s).toMap().value(u"User"_s).typeId(), QMetaType::QString);
-    EXPECT_TRUE(lastCameras(u"<NodeInfo>flat</NodeInfo>"_s).isEmpty());
-}
 
-TEST_F(TunnelControlTest, LocationParserTakesEveryListLaterEntryWins)
-{
-    const QVariantMap map = lastLocations(readData("locations_two_lists.xml"));
-    EXPECT_EQ(map.keys(), (QStringList{QString(), u"CamA"_s, u"CamB"_s, u"CamC"_s, u"Repeated"_s}));
-    EXPECT_EQ(map.value(u"CamA"_s),
-              QVariant(QVariantMap{
-                  {u"GroupID"_s, u"1"_s}, {u"IsRecording"_s, u"true"_s}, {u"Location"_s, u"Loc1"_s}}));
-    EXPECT_FALSE(map.value(u"CamC"_s).toMap().value(u"IsRecording"_s).toBool());
-    EXPECT_EQ(map.value(QString()).toMap().value(u"Location"_s), u"Loc4"_s);
-    EXPECT_EQ(map.value(u"Repeated"_s).toMap().value(u"Location"_s), u"Loc9"_s);
+    const QVariantMap locations = lastLocations(readData("locations_two_lists.xml"));
+    EXPECT_EQ(locations.keys(), (QStringList{QString(), u"CamA"_s, u"CamB"_s, u"CamC"_s, u"Repeated"_s}));
+    const QString located = u"CamA.Location=Loc1 CamA.GroupID=1 CamA.IsRecording=true CamC.IsRecording=false "
+                            ".Location=Loc4 Repeated.Location=Loc9"_s;
+    EXPECT_EQ(valuesFor(locations, located), located);
 }
 
 TEST_F(TunnelControlTest, AnswersInPartsAndFailedAnswers)
@@ -325,32 +268,6 @@ TEST_F(TunnelControlTest, BroadcastsAndStatusEvents)
         }
         EXPECT_EQ(take(), row.expected) << row.name << " " << row.message;
     }
-}
-
-TEST_F(TunnelControlTest, RequestsAndEventsOfOtherPartsArePassedThrough)
-{
-    int context = 0;
-    ASSERT_TRUE(
-        control->sendRequest(&client.account, u"Custom"_s, u"<C/>"_s, u"extra"_s, &context, ConfigServer));
-    EXPECT_EQ(client.requests.last().info.strExtra, u"extra"_s);
-    client.requests.last().info.respCB(false, u"Custom"_s, u"r/1"_s, u"-1"_s, u"no"_s, false);
-    client.requests.last().info.respCB(true, u"Custom"_s, QString(), u"0"_s, u"yes"_s, true);
-    EXPECT_EQ(take(), (QStringList{u"sent Custom <C/>"_s, u"reply 0 0 no r/1 -1"_s, u"reply 1 1 yes  0"_s}));
-    EXPECT_EQ(lastContext, &context);
-    client.accept = false;
-    EXPECT_FALSE(
-        control->sendRequest(&client.account, u"Custom"_s, QString(), QString(), nullptr, ConfigServer));
-
-    QStringList relayed;
-    QObject::connect(
-        control.get(), &NOVIRSrvTunnelControl::evtResp, control.get(),
-        [&](Qt::HANDLE, const QString& relay, const QString& text) { relayed << relay << text; });
-    ASSERT_TRUE(control->registerEventHandler(&client.account, u"Evt"_s, ConfigServer));
-    ASSERT_EQ(client.eventRegistrations.size(), 1);
-    EXPECT_EQ(client.eventRegistrations.first().name, u"Evt"_s);
-    client.eventHandlers.first()(client.handleOf(ConfigServer), u"src"_s, u"Evt"_s, ConfigServer, u"relay"_s,
-                                 u"<M/>"_s);
-    EXPECT_EQ(relayed, (QStringList{u"relay"_s, u"<M/>"_s}));
 }
 
 TEST_F(TunnelControlTest, LateCallbacksAfterDestructionFindTheGuard)

@@ -54,6 +54,16 @@ protected:
         return count;
     }
 
+    // The last call as "user:password@host:port[ ssl] path".
+    QString lastCall() const
+    {
+        const RecordingHttpClient::Call& c = client->calls.last();
+        return QStringLiteral("%1:%2@%3:%4%5 %6")
+            .arg(c.user, c.password, c.host)
+            .arg(c.port)
+            .arg(c.useSSL ? " ssl" : "", c.path);
+    }
+
     std::shared_ptr<RecordingHttpClient> client = std::make_shared<RecordingHttpClient>();
     std::unique_ptr<CameraProxy> proxy = std::make_unique<CameraProxy>(client);
 };
@@ -62,50 +72,29 @@ protected:
 
 TEST_F(CameraProxyTest, ComposedPathsAndCredentials)
 {
-    struct Row
-    {
-        QVariantMap extra; // over the default window 100..160
-        QString path;
-        QString password;
-        quint16 port;
-    };
-    const std::vector<Row> rows{
-        {{}, metaPath(100, 160), "admin", 8080},
-        {{{"multiChannelID", 1}},
-         "/VCA/c1/Data/DB/ObjectMeta?StartTime=100&EndTime=160&Info=127",
-         "admin",
-         8080},
-        {{{"multiChannelID", "0"}},
-         "/VCA/c0/Data/DB/ObjectMeta?StartTime=100&EndTime=160&Info=127",
-         "admin",
-         8080},
-        {{{"accessToken", "AbZ09-_x"}, {"multiChannelID", 2}},
-         "/VCA/c2/Data/DB/ObjMeta?accessToken=AbZ09-_x&StartTime=100&EndTime=160&Info=127",
-         "admin",
-         8080},
+    const QString query = QStringLiteral("StartTime=100&EndTime=160&Info=127");
+    const std::vector<std::pair<QVariantMap, QString>> rows{
+        {{}, "admin:admin@127.0.0.1:8080 /VCA/Data/DB/ObjectMeta?" + query},
+        {{{"multiChannelID", 1}}, "admin:admin@127.0.0.1:8080 /VCA/c1/Data/DB/ObjectMeta?" + query},
+        {{{"multiChannelID", "0"}}, "admin:admin@127.0.0.1:8080 /VCA/c0/Data/DB/ObjectMeta?" + query},
+        {{{"accessToken", "AbZ09-_x"}, {"multiChannelID", 2}, {"useSSL", true}},
+         "admin:admin@127.0.0.1:8080 ssl /VCA/c2/Data/DB/ObjMeta?accessToken=AbZ09-_x&" + query},
         // Characters that mean something in a query cannot leak out of the token.
         {{{"accessToken", "a+b/c=&StartTime=0 %"}},
-         "/VCA/Data/DB/"
-         "ObjMeta?accessToken=a%2Bb%2Fc%3D%26StartTime%3D0%20%25&StartTime=100&EndTime=160&Info=127",
-         "admin",
-         8080},
+         "admin:admin@127.0.0.1:8080 /VCA/Data/DB/ObjMeta?accessToken=a%2Bb%2Fc%3D%26StartTime%3D0%20%25&" +
+             query},
         // Hexadecimal Latin-1 password: non-hex characters are skipped, bytes above 127 survive.
-        {{{"password", "61:64-6dzE9"}}, metaPath(100, 160), QString::fromLatin1("adm\xe9"), 8080},
+        {{{"password", "61:64-6dzE9"}},
+         QString::fromLatin1("admin:adm\xe9@127.0.0.1:8080 /VCA/Data/DB/ObjectMeta?") + query},
         // A port that does not fit 16 bits is not narrowed into another one.
-        {{{"port", 65536 + 80}}, metaPath(100, 160), "admin", 0},
+        {{{"port", 65536 + 80}}, "admin:admin@127.0.0.1:0 /VCA/Data/DB/ObjectMeta?" + query},
     };
-    for (const Row& row : rows) {
+    for (const auto& [extra, expected] : rows) {
         QVariantMap request = window(QString::number(client->calls.size()), 100, 160);
-        request.insert(row.extra);
+        request.insert(extra);
         proxy->sendRequest(request, true);
-        const RecordingHttpClient::Call& call = client->calls.last();
-        EXPECT_EQ(call.path, row.path);
-        EXPECT_EQ(request.value("path").toString(), row.path);
-        EXPECT_EQ(call.password, row.password);
-        EXPECT_EQ(call.port, row.port);
-        EXPECT_EQ(call.host, "127.0.0.1");
-        EXPECT_EQ(call.user, "admin");
-        EXPECT_FALSE(call.useSSL);
+        EXPECT_EQ(lastCall(), expected);
+        EXPECT_EQ(request.value("path").toString(), client->calls.last().path);
     }
 }
 
@@ -148,26 +137,26 @@ TEST_F(CameraProxyTest, AnswersCountObjectsAndUnusableAnswersFail)
 {
     QSignalSpy answers(proxy.get(), &CameraProxy::receiveObjectMeta);
     QSignalSpy failed(proxy.get(), &CameraProxy::requestFailed);
-    const QByteArray bodies[] = {"{\"ObjectMetaInfo\": []}", "{\"ObjectMetaInfo\":[{},{},{}]}",
-                                 "{\"ObjectMetaInfo\":{\"ID\":1}}", "[1,2]"};
-    const int counts[] = {0, 3, 0, 0};
-    for (int i = 0; i < 4; ++i) {
+    const std::tuple<QNetworkReply::NetworkError, QByteArray, int> rows[] = {
+        // count -1: failed
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\": []}", 0},
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\":[{},{},{}]}", 3},
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\":{\"ID\":1}}", 0},
+        {QNetworkReply::NoError, "[1,2]", 0},
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\": [", -1},
+        {QNetworkReply::NoError, QByteArray(), -1},
+        {QNetworkReply::ContentAccessDenied, "{}", -1}};
+    for (const auto& [error, body, count] : rows) {
+        const int i = client->calls.size();
         send(QString::number(i), 100, 160 + i);
-        client->complete(i, QNetworkReply::NoError, bodies[i]);
-        ASSERT_EQ(answers.size(), i + 1);
-        EXPECT_EQ(answers[i][0].toString(), QString::number(i));
-        EXPECT_EQ(answers[i][1].toUInt(), 160u + unsigned(i)); // the request's own end
-        EXPECT_EQ(answers[i][2].toMap(), (QVariantMap{{"count", counts[i]}, {"data", bodies[i]}}));
-    }
-    EXPECT_EQ(logLines(), 0);
-
-    const std::pair<QNetworkReply::NetworkError, QByteArray> bad[] = {
-        {QNetworkReply::NoError, "{\"ObjectMetaInfo\": ["},
-        {QNetworkReply::NoError, QByteArray()},
-        {QNetworkReply::ContentAccessDenied, "{}"}};
-    for (const auto& [error, body] : bad) {
-        send("x", 100, 160);
-        client->complete(client->calls.size() - 1, error, body);
+        client->complete(i, error, body);
+        if (count < 0) {
+            EXPECT_EQ(failed.last(), QList<QVariant>{QString::number(i)}) << body.constData();
+            continue;
+        }
+        // The request's own end, and the answer with its number of objects.
+        EXPECT_EQ(answers.last(), (QList<QVariant>{QString::number(i), 160u + unsigned(i),
+                                                   QVariantMap{{"count", count}, {"data", body}}}));
     }
     EXPECT_EQ(answers.size(), 4);
     EXPECT_EQ(failed.size(), 3);
@@ -179,22 +168,13 @@ TEST_F(CameraProxyTest, PairTokenExchangeBypassesTheQueue)
     const QVariantMap record{{"Name", "vault"},     {"IP", "10.0.0.5"},   {"Port", "8443"},
                              {"User", "op"},        {"Password", "7077"}, {"UseSSL", true},
                              {"MultiChannelID", 3}, {"Location", "Loc4"}};
-    EXPECT_EQ(proxy->composePairTokenRequest(record),
-              (QVariantMap{{"path", "/VCA/Secure/Token?method=GET&resource=/Data/DB/ObjMeta&client=NOVIR2"},
-                           {"cameraID", "vault"},
-                           {"ip", "10.0.0.5"},
-                           {"port", 8443},
-                           {"username", "op"},
-                           {"password", "pw"},
-                           {"useSSL", true}}));
-
     QSignalSpy tokens(proxy.get(), &CameraProxy::receivePairToken);
     send("vault", 0, 60);
     send("vault", 60, 120);
     proxy->sendPairTokenRequest(record); // goes out although a metadata request is outstanding
     ASSERT_EQ(client->calls.size(), 2);
-    EXPECT_EQ(client->calls[1].port, 8443);
-    EXPECT_TRUE(client->calls[1].useSSL);
+    EXPECT_EQ(lastCall(),
+              "op:pw@10.0.0.5:8443 ssl /VCA/Secure/Token?method=GET&resource=/Data/DB/ObjMeta&client=NOVIR2");
     client->complete(1, QNetworkReply::NoError, QString::fromUtf8("tok\xc3\xa9n").toUtf8());
     ASSERT_EQ(tokens.size(), 1);
     EXPECT_EQ(tokens[0][1].toString(), QString::fromUtf8("tok\xc3\xa9n"));

@@ -1,13 +1,17 @@
 // The synchroniser with a recording proxy and a simulated clock: the windows of a pass, last-sync
-// rules, enable switch, pair tokens, client-requested windows and the settings files.
+// rules, enable switch, pair tokens and the access tokens made from them, client-requested windows
+// and the settings files.
 #include "CameraSynchronizer.h"
 #include "FakeWemlo.h"
+#include "HostFakes.h"
 #include "LogFacility.h"
-#include "RecordingHttpClient.h"
+#include "TokenConverter.h"
 
 #include <QCoreApplication>
 #include <QDir>
 #include <QFile>
+#include <QJsonDocument>
+#include <QJsonObject>
 #include <QSignalSpy>
 #include <QTemporaryDir>
 #include <QThread>
@@ -16,9 +20,12 @@
 #include <atomic>
 #include <thread>
 
+using namespace Qt::StringLiterals;
+
 namespace {
 
 constexpr qint64 T = 1'700'000'000;
+using Windows = QList<QPair<qint64, qint64>>;
 
 // Records what the synchroniser asks for instead of sending it.
 class RecordingProxy : public CameraProxy
@@ -30,27 +37,32 @@ public:
     void sendRequest(QVariantMap& request, bool dropCovered) override
     {
         requests.append(request);
-        dropFlags.append(dropCovered);
-        threads.append(QThread::currentThread());
+        EXPECT_EQ(dropCovered, !clientRequested); // a window the client asked for is never dropped
+        EXPECT_EQ(QThread::currentThread(), qApp->thread());
     }
     void sendPairTokenRequest(const QVariantMap& record) override { tokenRequests.append(record); }
-
-    QList<QPair<qint64, qint64>> windows(const QString& camera) const
+    Windows windows(const QString& camera) const
     {
-        QList<QPair<qint64, qint64>> result;
+        Windows result;
         for (const QVariantMap& r : requests) {
-            if (r.value("cameraID").toString() == camera) {
+            if (r.value("cameraID") == camera) {
                 result.append({r.value("startTimestamp").toLongLong(), r.value("endTimestamp").toLongLong()});
             }
         }
         return result;
     }
 
+    bool clientRequested = false;
     QList<QVariantMap> requests;
-    QList<bool> dropFlags;
-    QList<QThread*> threads;
     QList<QVariantMap> tokenRequests;
 };
+
+bool acceptedBy(const std::string& pairToken, const std::string& accessToken)
+{
+    auto camera = Zelto::CreateProtectedAPIManager("", 0, true);
+    camera->SetPairToken(pairToken.data(), pairToken.size(), true);
+    return camera->VerifyAccessToken(accessToken);
+}
 
 class CameraSynchronizerTest : public ::testing::Test
 {
@@ -59,31 +71,27 @@ protected:
     {
         fakeWemloReset();
         LogFacility::reload(FAKE_WEMLO_PATH);
-        ASSERT_TRUE(m_dir.isValid());
-        m_previousDir = QDir::currentPath();
-        QDir::setCurrent(m_dir.path()); // the settings files are read from the working directory
+        previousDir = QDir::currentPath();
+        QDir::setCurrent(dir.path()); // the settings files are read from the working directory
     }
     void TearDown() override
     {
-        m_sync.reset();
-        QDir::setCurrent(m_previousDir);
+        sync.reset();
+        QDir::setCurrent(previousDir);
         fakeWemloReset();
     }
-
     void writeFile(const QString& name, const QByteArray& content)
     {
-        QFile file(m_dir.filePath(name));
+        QFile file(dir.filePath(name));
         ASSERT_TRUE(file.open(QIODevice::WriteOnly));
         file.write(content);
     }
-
     CameraSynchronizer& make()
     {
-        m_proxy = std::make_shared<RecordingProxy>();
-        m_sync = std::make_unique<CameraSynchronizer>(m_proxy, [this] { return m_nowMs.load(); });
-        return *m_sync;
+        proxy = std::make_shared<RecordingProxy>();
+        sync = std::make_unique<CameraSynchronizer>(proxy, [this] { return nowMs.load(); });
+        return *sync;
     }
-
     static QVariantMap record(const QString& name, bool protect = false)
     {
         return QVariantMap{
@@ -92,241 +100,201 @@ protected:
             {"GroupID", 2}};
     }
 
-    static int errorLines()
-    {
-        int n = 0;
-        for (const FakeWemloLine& line : fakeWemloState().lines) {
-            n += line.text.find("not usable") != std::string::npos ? 1 : 0;
-        }
-        return n;
-    }
-
-    QTemporaryDir m_dir;
-    QString m_previousDir;
-    std::atomic<qint64> m_nowMs{T * 1000 + 999}; // the milliseconds are cut off
-    std::shared_ptr<RecordingProxy> m_proxy;
-    std::unique_ptr<CameraSynchronizer> m_sync;
+    QTemporaryDir dir;
+    QString previousDir;
+    std::atomic<qint64> nowMs{T * 1000 + 999}; // the milliseconds are cut off
+    std::shared_ptr<RecordingProxy> proxy;
+    std::unique_ptr<CameraSynchronizer> sync;
 };
-
-using Windows = QList<QPair<qint64, qint64>>;
 
 } // namespace
 
 TEST_F(CameraSynchronizerTest, WindowsOfAPassFollowTheLastSyncTime)
 {
-    CameraSynchronizer& sync = make();
     QVariantMap channel = record("yard-c1");
     channel.insert("MultiChannelID", "1");
-    sync.updateInformation({{"fresh", record("fresh")},
-                            {"behind", record("behind")},
-                            {"far", record("far")},
-                            {"recent", record("recent")},
-                            {"future", record("future")},
-                            {"yard-c1", channel}});
-    sync.updateLastSync({{"behind", uint(T - 600)},
-                         {"far", uint(T - 7200)},
-                         {"recent", uint(T - 180)},
-                         {"future", uint(T + 500)}});
-    sync.synchronize();
-
-    EXPECT_EQ(m_proxy->windows("fresh"), (Windows{{T - 240, T - 180}}));
-    Windows seven;
-    for (qint64 s = T - 600; s < T - 180; s += 60) {
-        seven.append({s, s + 60});
+    make().updateInformation({{"fresh", record("fresh")},
+                              {"behind", record("behind")},
+                              {"far", record("far")},
+                              {"recent", record("recent")},
+                              {"future", record("future")},
+                              {"yard-c1", channel}});
+    sync->updateLastSync({{"behind", uint(T - 600)},
+                          {"far", uint(T - 7200)},
+                          {"recent", uint(T - 180)},
+                          {"future", uint(T + 500)}});
+    sync->synchronize();
+    // "count first-start..last-end" against the present; at most an hour's worth per pass.
+    QStringList spans;
+    for (const char* camera : {"fresh", "behind", "far", "recent", "future"}) {
+        const Windows w = proxy->windows(camera);
+        spans << (w.isEmpty()
+                      ? u"0"_s
+                      : u"%1 %2..%3"_s.arg(w.size()).arg(w.first().first - T).arg(w.last().second - T));
     }
-    EXPECT_EQ(m_proxy->windows("behind"), seven);
-    const Windows far = m_proxy->windows("far");
-    ASSERT_EQ(far.size(), 60);
-    EXPECT_EQ(far.first(), (QPair<qint64, qint64>{T - 7200, T - 7140}));
-    EXPECT_EQ(far.last(), (QPair<qint64, qint64>{T - 3660, T - 3600}));
-    EXPECT_TRUE(m_proxy->windows("recent").isEmpty());
-    EXPECT_TRUE(m_proxy->windows("future").isEmpty());
-    for (bool drop : m_proxy->dropFlags) {
-        EXPECT_TRUE(drop);
-    }
-
-    const QVariantMap request = m_proxy->requests.last();
-    EXPECT_EQ(request, (QVariantMap{{"cameraID", "yard-c1"},
-                                    {"startTimestamp", T - 240},
-                                    {"endTimestamp", T - 180},
-                                    {"ip", "127.0.0.1"},
-                                    {"port", 8000},
-                                    {"username", "admin"},
-                                    {"password", "6162"},
-                                    {"useSSL", false},
-                                    {"accessToken", QString()},
-                                    {"multiChannelID", "1"}}));
-    EXPECT_EQ(request.value("startTimestamp").typeId(), QMetaType::LongLong);
-    EXPECT_EQ(request.value("port").typeId(), QMetaType::Int);
-    EXPECT_FALSE(m_proxy->requests.first().contains("multiChannelID"));
+    EXPECT_EQ(spans, (QStringList{"1 -240..-180", "7 -600..-180", "60 -7200..-3600", "0", "0"}));
+    EXPECT_EQ(
+        QJsonDocument(QJsonObject::fromVariantMap(proxy->requests.last())).toJson(QJsonDocument::Compact),
+        R"({"accessToken":"","cameraID":"yard-c1","endTimestamp":1699999820,"ip":"127.0.0.1",)"
+        R"("multiChannelID":"1","password":"6162","port":8000,"startTimestamp":1699999760,)"
+        R"("useSSL":false,"username":"admin"})");
+    EXPECT_FALSE(proxy->requests.first().contains("multiChannelID"));
 }
 
 TEST_F(CameraSynchronizerTest, LastSyncNeverMovesBackAndCamerasThatLeftAreIgnored)
 {
-    CameraSynchronizer& sync = make();
-    sync.updateInformation({{"a", record("a")}});
-    QSignalSpy forwarded(&sync, &CameraSynchronizer::receiveResponseData);
+    make().updateInformation({{"a", record("a")}});
+    QSignalSpy forwarded(sync.get(), &CameraSynchronizer::receiveResponseData);
     const QVariantMap data{{"data", QByteArray("{}")}, {"count", 2}};
-
-    sync.receiveObjectMeta("a", 500, data);
-    sync.receiveObjectMeta("a", 400, data); // older window: still forwarded, time kept
-    EXPECT_EQ(sync.getLastSyncMap().value("a").toUInt(), 500u);
+    sync->receiveObjectMeta("a", 500, data);
+    sync->receiveObjectMeta("a", 400, data); // older window: still forwarded, time kept
+    EXPECT_EQ(sync->getLastSyncMap().value("a").toUInt(), 500u);
     ASSERT_EQ(forwarded.size(), 2);
-    EXPECT_EQ(forwarded[1][0].toMap(), record("a"));
-    EXPECT_EQ(forwarded[1][1].toUInt(), 400u);
-    EXPECT_EQ(forwarded[1][2].toMap(), data);
-    sync.updateLastSync({{"a", 0u}});
-    sync.receiveObjectMeta("a", 7, data);
-    EXPECT_EQ(sync.getLastSyncMap().value("a").toUInt(), 7u);
-    sync.receiveObjectMeta("a", 0xF0000000u, data); // compared unsigned
-    EXPECT_EQ(sync.getLastSyncMap().value("a").toUInt(), 0xF0000000u);
+    EXPECT_EQ(forwarded[1], (QList<QVariant>{record("a"), 400u, data}));
+    sync->updateLastSync({{"a", 0u}});
+    sync->receiveObjectMeta("a", 7, data);
+    EXPECT_EQ(sync->getLastSyncMap().value("a").toUInt(), 7u);
+    sync->receiveObjectMeta("a", 0xF0000000u, data); // compared unsigned
+    EXPECT_EQ(sync->getLastSyncMap().value("a").toUInt(), 0xF0000000u);
 
-    sync.receiveObjectMeta("gone", 900, data);
-    EXPECT_FALSE(sync.getLastSyncMap().contains("gone"));
+    sync->receiveObjectMeta("gone", 900, data);
+    EXPECT_FALSE(sync->getLastSyncMap().contains("gone"));
     EXPECT_EQ(forwarded.size(), 4);
+    sync->removeCameraLastSync("a");
+    EXPECT_TRUE(sync->getLastSyncMap().isEmpty());
 
-    sync.removeCameraLastSync("a");
-    EXPECT_TRUE(sync.getLastSyncMap().isEmpty());
-}
-
-TEST_F(CameraSynchronizerTest, DisabledSyncForgetsLastSyncAndSendsNothing)
-{
-    CameraSynchronizer& sync = make();
-    sync.updateInformation({{"a", record("a")}});
-    sync.updateLastSync({{"a", uint(T - 600)}});
+    // Disabled: last sync forgotten, nothing sent, not even on request; enabled again it starts afresh.
+    sync->updateLastSync({{"a", uint(T - 600)}});
     for (const QVariantMap& settings : {QVariantMap{{"enable", false}}, QVariantMap{}}) {
-        sync.setEnableDelvix(settings);
-        sync.synchronize();
-        sync.retrieveDelvixData("a", T - 1000, T - 900);
-        EXPECT_TRUE(sync.getLastSyncMap().isEmpty());
-        EXPECT_TRUE(m_proxy->requests.isEmpty());
+        sync->setEnableDelvix(settings);
+        sync->synchronize();
+        sync->retrieveDelvixData("a", T - 1000, T - 900);
+        QCoreApplication::processEvents();
+        EXPECT_TRUE(sync->getLastSyncMap().isEmpty());
+        EXPECT_TRUE(proxy->requests.isEmpty());
     }
-    sync.setEnableDelvix({{"enable", true}});
-    sync.synchronize();
-    EXPECT_EQ(m_proxy->windows("a"), (Windows{{T - 240, T - 180}})); // starts afresh
+    sync->setEnableDelvix({{"enable", true}});
+    sync->synchronize();
+    EXPECT_EQ(proxy->windows("a"), (Windows{{T - 240, T - 180}}));
 }
 
-TEST_F(CameraSynchronizerTest, DirectoryChangesAskProtectedCamerasForPairTokens)
+TEST_F(CameraSynchronizerTest, ProtectedCamerasAreAskedForPairTokensAndFetchedWithAccessTokens)
 {
-    CameraSynchronizer& sync = make();
     const QVariantMap cameras{{"open", record("open")}, {"vault", record("vault", true)}};
-    sync.updateInformation(cameras);
-    ASSERT_EQ(m_proxy->tokenRequests.size(), 1);
-    EXPECT_EQ(m_proxy->tokenRequests[0], record("vault", true));
-    sync.updateInformation(cameras); // equal: nothing
-    EXPECT_EQ(m_proxy->tokenRequests.size(), 1);
+    make().updateInformation(cameras);
+    ASSERT_EQ(proxy->tokenRequests, QList<QVariantMap>{record("vault", true)});
+    sync->updateInformation(cameras); // equal: nothing
+    EXPECT_EQ(proxy->tokenRequests.size(), 1);
 
-    sync.synchronize(); // still no token: asked again, and synchronised unprotected meanwhile
-    EXPECT_EQ(m_proxy->tokenRequests.size(), 2);
-    EXPECT_EQ(m_proxy->requests.last().value("accessToken").toString(), QString());
+    sync->synchronize(); // still no token: asked again, and fetched unprotected meanwhile
+    EXPECT_EQ(proxy->tokenRequests.size(), 2);
+    EXPECT_EQ(proxy->requests.last().value("accessToken").toString(), QString());
 
     const std::string pairToken = Zelto::GeneratePairToken();
-    sync.receivePairToken("vault", QString::fromStdString(pairToken));
-    m_nowMs += 60'000;
-    sync.synchronize();
-    EXPECT_EQ(m_proxy->tokenRequests.size(), 2);
-    const QString token = m_proxy->requests.last().value("accessToken").toString();
-    auto camera = Zelto::CreateProtectedAPIManager("", 0, true);
-    camera->SetPairToken(pairToken.data(), pairToken.size(), true);
-    EXPECT_TRUE(camera->VerifyAccessToken(token.toStdString()));
-    EXPECT_EQ(m_proxy->requests.last().value("cameraID").toString(), "vault");
+    sync->receivePairToken("vault", QString::fromStdString(pairToken));
+    nowMs += 60'000;
+    sync->synchronize();
+    EXPECT_EQ(proxy->tokenRequests.size(), 2);
+    const QVariantMap vault = proxy->requests.last();
+    EXPECT_EQ(vault.value("cameraID"), "vault");
+    EXPECT_TRUE(acceptedBy(pairToken, vault.value("accessToken").toString().toStdString()));
     EXPECT_TRUE(
-        m_proxy->requests[m_proxy->requests.size() - 2].value("accessToken").toString().isEmpty()); // open
+        proxy->requests[proxy->requests.size() - 2].value("accessToken").toString().isEmpty()); // open
 
     QVariantMap changed = cameras;
     changed.insert("other", record("other", true));
-    sync.updateInformation(changed); // any change forgets every token and asks every protected camera
-    EXPECT_EQ(m_proxy->tokenRequests.size(), 4);
-    sync.synchronize();
-    EXPECT_EQ(m_proxy->tokenRequests.size(), 6);
+    sync->updateInformation(changed); // any change forgets every token and asks every protected camera
+    EXPECT_EQ(proxy->tokenRequests.size(), 4);
+    sync->synchronize();
+    EXPECT_EQ(proxy->tokenRequests.size(), 6);
+}
+
+TEST(TokenConverter, AccessTokensAreFreshAndAcceptedOnlyForTheirPairToken)
+{
+    TokenConverter converter;
+    const std::string pairToken = Zelto::GeneratePairToken();
+    const std::string first = converter.genAccessToken(pairToken);
+    const std::string second = converter.genAccessToken(pairToken);
+    EXPECT_NE(first, second);
+    EXPECT_TRUE(acceptedBy(pairToken, first));
+    EXPECT_TRUE(acceptedBy(pairToken, second));
+    EXPECT_FALSE(acceptedBy(pairToken, converter.genAccessToken(Zelto::GeneratePairToken())));
 }
 
 TEST_F(CameraSynchronizerTest, ClientRequestedWindowIsOneRequestOnTheOwnerThread)
 {
-    CameraSynchronizer& sync = make();
     QVariantMap channel = record("yard-c0");
     channel.insert("MultiChannelID", 0);
-    sync.updateInformation({{"yard-c0", channel}});
-    sync.retrieveDelvixData("nobody", T - 9000, T - 100);
-    EXPECT_TRUE(m_proxy->requests.isEmpty());
-
-    std::thread host([&] { sync.retrieveDelvixData("yard-c0", T - 9000, T - 100); });
-    host.join();
-    EXPECT_TRUE(m_proxy->requests.isEmpty()); // not on the host's thread
+    make().updateInformation({{"yard-c0", channel}});
+    proxy->clientRequested = true;
+    sync->retrieveDelvixData("nobody", T - 9000, T - 100);
+    std::thread([&] { sync->retrieveDelvixData("yard-c0", T - 9000, T - 100); }).join();
+    EXPECT_TRUE(proxy->requests.isEmpty()); // not on the host's thread
     QCoreApplication::processEvents();
-    ASSERT_EQ(m_proxy->requests.size(), 1);
-    EXPECT_EQ(m_proxy->threads[0], QThread::currentThread());
-    EXPECT_FALSE(m_proxy->dropFlags[0]);
-    EXPECT_EQ(m_proxy->windows("yard-c0"), (Windows{{T - 9000, T - 100}}));
-    EXPECT_EQ(m_proxy->requests[0].value("multiChannelID").toInt(), 0);
+    ASSERT_EQ(proxy->windows("yard-c0"), (Windows{{T - 9000, T - 100}}));
+    EXPECT_EQ(proxy->requests.size(), 1);
+    EXPECT_EQ(proxy->requests[0].value("multiChannelID").toInt(), 0);
 
     // A call still on its way when the synchroniser goes is dropped, not run on a dead object.
-    std::thread late([&] { sync.retrieveDelvixData("yard-c0", T - 50, T); });
-    late.join();
-    m_sync.reset();
+    std::thread([&] { sync->retrieveDelvixData("yard-c0", T - 50, T); }).join();
+    sync.reset();
     QCoreApplication::processEvents();
-    EXPECT_EQ(m_proxy->requests.size(), 1);
-}
+    EXPECT_EQ(proxy->requests.size(), 1);
 
-TEST_F(CameraSynchronizerTest, ReplacedProxyAnswersStillArrive)
-{
-    CameraSynchronizer& sync = make();
-    sync.updateInformation({{"a", record("a")}});
+    // Answers of a proxy set later still arrive.
+    make().updateInformation({{"a", record("a")}});
     auto client = std::make_shared<RecordingHttpClient>();
-    auto proxy = std::make_shared<CameraProxy>(client);
-    sync.setHttpClient(proxy);
-    sync.synchronize();
+    sync->setHttpClient(std::make_shared<CameraProxy>(client));
+    sync->synchronize();
     ASSERT_EQ(client->calls.size(), 1);
     client->complete(0, QNetworkReply::NoError, "{\"ObjectMetaInfo\":[{}]}");
-    EXPECT_EQ(sync.getLastSyncMap().value("a").toUInt(), uint(T - 180));
+    EXPECT_EQ(sync->getLastSyncMap().value("a").toUInt(), uint(T - 180));
 }
 
-TEST_F(CameraSynchronizerTest, SettingsFilesAbsentPresentAndUnusable)
+TEST_F(CameraSynchronizerTest, SettingsFiles)
 {
+    struct Row
     {
-        CameraSynchronizer& sync = make();
-        EXPECT_EQ(sync.routineSyncPeriodSecond(), 60);
-        EXPECT_EQ(sync.delayGetObjectDataSecond(), 180u);
-        EXPECT_EQ(sync.timerIntervalMs(), 60000);
-    }
-    writeFile("routineSyncTimeBuffer.txt", "10\n30\n");
-    writeFile("getObjectDataTimeBuffer.txt", "120");
-    {
-        CameraSynchronizer& sync = make();
-        EXPECT_EQ(sync.routineSyncPeriodSecond(), 30);
-        EXPECT_EQ(sync.delayGetObjectDataSecond(), 120u);
-        EXPECT_EQ(sync.timerIntervalMs(), 30000);
-        sync.updateInformation({{"a", record("a")}});
-        sync.synchronize();
-        EXPECT_EQ(m_proxy->windows("a"), (Windows{{T - 150, T - 120}}));
-    }
-    EXPECT_EQ(errorLines(), 0);
-
-    // Periods that would spin the timer or overflow its interval fall back to 60 s, logged.
-    const QByteArray badPeriods[] = {"0", "-5", "sixty", "30\n", "3000000"};
-    int expectedLines = 0;
-    for (const QByteArray& bad : badPeriods) {
-        writeFile("routineSyncTimeBuffer.txt", bad);
-        CameraSynchronizer& sync = make();
-        const bool usable = bad == "30\n";
-        EXPECT_EQ(sync.routineSyncPeriodSecond(), usable ? 30 : 60) << bad.constData();
-        expectedLines += usable ? 0 : 1;
-        EXPECT_EQ(errorLines(), expectedLines);
-    }
-    writeFile("routineSyncTimeBuffer.txt", "60\n\n"); // the last line is empty: unusable
-    EXPECT_EQ(make().routineSyncPeriodSecond(), 60);
-    EXPECT_EQ(errorLines(), ++expectedLines);
-
-    writeFile("routineSyncTimeBuffer.txt", "60");
-    writeFile("getObjectDataTimeBuffer.txt", "later");
-    EXPECT_EQ(make().delayGetObjectDataSecond(), 0u);       // not a number reads as 0, which is usable
-    writeFile("getObjectDataTimeBuffer.txt", "4000000000"); // beyond the present
-    {
-        CameraSynchronizer& sync = make();
-        EXPECT_EQ(sync.delayGetObjectDataSecond(), 180u);
-        EXPECT_EQ(errorLines(), ++expectedLines);
-        sync.updateInformation({{"a", record("a")}});
-        sync.synchronize();
-        EXPECT_EQ(m_proxy->windows("a"), (Windows{{T - 240, T - 180}}));
+        const char* period; // routineSyncTimeBuffer.txt, null: absent
+        const char* delay;  // getObjectDataTimeBuffer.txt, null: absent
+        int expectedPeriod;
+        unsigned expectedDelay;
+        bool logged;
+    };
+    const std::vector<Row> rows{
+        {nullptr, nullptr, 60, 180, false},
+        {"10\n30\n", "120", 30, 120, false},
+        {"30\n", nullptr, 30, 180, false},
+        // Periods that would spin the timer or overflow its interval fall back to 60 s; so does a
+        // file whose last line is empty.
+        {"0", nullptr, 60, 180, true},
+        {"-5", nullptr, 60, 180, true},
+        {"sixty", nullptr, 60, 180, true},
+        {"3000000", nullptr, 60, 180, true},
+        {"60\n\n", nullptr, 60, 180, true},
+        // Not a number reads as 0, which is usable; a delay beyond the present is not.
+        {nullptr, "later", 60, 0, false},
+        {nullptr, "4000000000", 60, 180, true},
+    };
+    for (const Row& row : rows) {
+        QFile::remove(dir.filePath("routineSyncTimeBuffer.txt"));
+        QFile::remove(dir.filePath("getObjectDataTimeBuffer.txt"));
+        if (row.period) {
+            writeFile("routineSyncTimeBuffer.txt", row.period);
+        }
+        if (row.delay) {
+            writeFile("getObjectDataTimeBuffer.txt", row.delay);
+        }
+        fakeWemloReset();
+        LogFacility::reload(FAKE_WEMLO_PATH);
+        make().updateInformation({{"a", record("a")}});
+        EXPECT_EQ(sync->routineSyncPeriodSecond(), row.expectedPeriod) << row.period;
+        EXPECT_EQ(sync->timerIntervalMs(), row.expectedPeriod * 1000) << row.period;
+        EXPECT_EQ(sync->delayGetObjectDataSecond(), row.expectedDelay) << row.delay;
+        EXPECT_EQ(fakeWemloState().lines.size(), row.logged ? 1u : 0u) << row.period << " " << row.delay;
+        sync->synchronize();
+        const qint64 end = T - row.expectedDelay;
+        EXPECT_EQ(proxy->windows("a"), (Windows{{end - row.expectedPeriod, end}}))
+            << row.period << " " << row.delay;
     }
 }

@@ -1,6 +1,7 @@
 #pragma once
 // A tunnel client the test drives by hand: it records every registration and request and calls
 // the handlers and response callbacks only when the test says so, on the test's thread.
+// Header-only; used by the camera directory tests and the directory fuzz targets.
 
 #include "INovirTunnelClient.h"
 
@@ -11,11 +12,12 @@
 class ScriptedTunnelClient : public INovirTunnelClient
 {
 public:
+    using ServerType = NSNovirTunnelClient::ServerType;
     struct Request
     {
         QString pluginId;
         void* clientID = nullptr;
-        NSNovirTunnelClient::ServerType type = NSNovirTunnelClient::ConfigServer;
+        ServerType type = NSNovirTunnelClient::ConfigServer;
         QString cmdName;
         NSNovirTunnelClient::RequestInfo info;
         bool subscribe = false;
@@ -25,38 +27,32 @@ public:
     struct Registration
     {
         QString pluginId;
-        NSNovirTunnelClient::ServerType type;
+        ServerType type;
         QString name;
+        NSNovirTunnelClient::BroadcastHandler handler;
     };
 
-    bool accept = true; // what insertRequest and insertSubscribeRequest answer
     // The hastiest client possible: servers already up are reported from inside the
     // registration, and onInsert may answer a request from inside the call that sent it.
     bool connectOnRegister = false;
     std::function<void(int requestIndex)> onInsert;
     QString serverId = QStringLiteral("srv-1");
     QList<Request> requests;
-    QList<Registration> connectRegistrations;
     QList<Registration> broadcastRegistrations;
-    QList<Registration> eventRegistrations;
+    QStringList connectRegistrations; // plug-in ids
     QList<NSNovirTunnelClient::ConnectStatusHandler> connectHandlers;
-    QList<NSNovirTunnelClient::BroadcastHandler> broadcastHandlers; // parallel to broadcastRegistrations
-    QList<NSNovirTunnelClient::EventHandler> eventHandlers;         // parallel to eventRegistrations
     char account = 0;
-    char configServer = 0;
-    char locationServer = 0;
+    char servers[2] = {};
 
-    Qt::HANDLE handleOf(NSNovirTunnelClient::ServerType type)
+    Qt::HANDLE handleOf(ServerType type)
     {
-        return type == NSNovirTunnelClient::LocationServer ? static_cast<Qt::HANDLE>(&locationServer)
-                                                           : static_cast<Qt::HANDLE>(&configServer);
+        return &servers[type == NSNovirTunnelClient::LocationServer ? 1 : 0];
     }
 
     // ---- test verbs ----
-    void connectServer(NSNovirTunnelClient::ServerType type, bool connected = true)
+    void connectServer(ServerType type, bool connected = true)
     {
-        const auto handlers = connectHandlers;
-        for (const auto& handler : handlers) {
+        for (const auto& handler : QList(connectHandlers)) {
             handler(handleOf(type), type, connected);
         }
     }
@@ -76,30 +72,22 @@ public:
         }
         return -1;
     }
-    int countRequests(const QString& cmdName) const
-    {
-        int count = 0;
-        for (const Request& request : requests) {
-            count += request.cmdName == cmdName ? 1 : 0;
-        }
-        return count;
-    }
     void broadcast(const QString& name, const QString& relayPath, const QString& message)
     {
-        for (int i = 0; i < broadcastRegistrations.size(); ++i) {
-            if (broadcastRegistrations.at(i).name == name) {
-                broadcastHandlers.at(i)(handleOf(NSNovirTunnelClient::ConfigServer), name,
-                                        NSNovirTunnelClient::ConfigServer, relayPath, message);
+        for (const Registration& registration : QList(broadcastRegistrations)) {
+            if (registration.name == name) {
+                registration.handler(handleOf(NSNovirTunnelClient::ConfigServer), name,
+                                     NSNovirTunnelClient::ConfigServer, relayPath, message);
             }
         }
     }
     // Sends a status event through the subscription's handler.
     void statusEvent(const QString& sourceId, const QString& relayPath, const QString& message)
     {
-        const int index = lastRequest(QStringLiteral("SubCamStatus"));
-        requests.at(index).eventHandler(handleOf(NSNovirTunnelClient::ConfigServer), sourceId,
-                                        QStringLiteral("CamStatus"), NSNovirTunnelClient::ConfigServer,
-                                        relayPath, message);
+        const Request request = requests.at(lastRequest(QStringLiteral("SubCamStatus")));
+        request.eventHandler(handleOf(NSNovirTunnelClient::ConfigServer), sourceId,
+                             QStringLiteral("CamStatus"), NSNovirTunnelClient::ConfigServer, relayPath,
+                             message);
     }
 
     // ---- INovirTunnelClient ----
@@ -109,52 +97,49 @@ public:
         return clientID == handleOf(NSNovirTunnelClient::ConfigServer) && infoKind == 3 ? QVariant(serverId)
                                                                                         : QVariant();
     }
-    bool isServerConnected(NSNovirTunnelClient::ServerType) override { return true; }
-    bool insertRequest(const QString& pluginId, void* clientID, NSNovirTunnelClient::ServerType type,
-                       const QString& cmdName, const NSNovirTunnelClient::RequestInfo& request) override
+    bool isServerConnected(ServerType) override { return true; }
+    bool insertRequest(const QString& pluginId, void* clientID, ServerType type, const QString& cmdName,
+                       const NSNovirTunnelClient::RequestInfo& request) override
     {
-        requests.append(Request{pluginId, clientID, type, cmdName, request, false, QString(), {}});
-        if (onInsert) {
-            onInsert(int(requests.size()) - 1);
-        }
-        return accept;
+        return insert(Request{pluginId, clientID, type, cmdName, request, false, QString(), {}});
     }
-    bool insertSubscribeRequest(const QString& pluginId, void* clientID, NSNovirTunnelClient::ServerType type,
+    bool insertSubscribeRequest(const QString& pluginId, void* clientID, ServerType type,
                                 const QString& cmdName, const NSNovirTunnelClient::RequestInfo& request,
                                 const QString& subscribedServerId,
                                 const NSNovirTunnelClient::EventHandler& eventHandler) override
     {
-        requests.append(
+        return insert(
             Request{pluginId, clientID, type, cmdName, request, true, subscribedServerId, eventHandler});
-        if (onInsert) {
-            onInsert(int(requests.size()) - 1);
-        }
-        return accept;
     }
-    void registerConnectStatusHandler(const QString& pluginId, NSNovirTunnelClient::ServerType type,
+    void registerConnectStatusHandler(const QString& pluginId, ServerType,
                                       const NSNovirTunnelClient::ConnectStatusHandler& handler,
                                       const QString&) override
     {
-        connectRegistrations.append(Registration{pluginId, type, QString()});
+        connectRegistrations.append(pluginId);
         connectHandlers.append(handler);
         if (connectOnRegister) {
             handler(handleOf(NSNovirTunnelClient::ConfigServer), NSNovirTunnelClient::ConfigServer, true);
             handler(handleOf(NSNovirTunnelClient::LocationServer), NSNovirTunnelClient::LocationServer, true);
         }
     }
-    void registerEventHandler(const QString& pluginId, void*, NSNovirTunnelClient::ServerType type,
-                              const QString& eventName, const NSNovirTunnelClient::EventHandler& handler,
-                              const QString&) override
-    {
-        eventRegistrations.append(Registration{pluginId, type, eventName});
-        eventHandlers.append(handler);
-    }
-    void registerBroadcastHandler(const QString& pluginId, void*, NSNovirTunnelClient::ServerType type,
+    void registerEventHandler(const QString&, void*, ServerType, const QString&,
+                              const NSNovirTunnelClient::EventHandler&, const QString&) override
+    {}
+    void registerBroadcastHandler(const QString& pluginId, void*, ServerType type,
                                   const QString& broadcastName,
                                   const NSNovirTunnelClient::BroadcastHandler& handler,
                                   const QString&) override
     {
-        broadcastRegistrations.append(Registration{pluginId, type, broadcastName});
-        broadcastHandlers.append(handler);
+        broadcastRegistrations.append(Registration{pluginId, type, broadcastName, handler});
+    }
+
+private:
+    bool insert(Request request)
+    {
+        requests.append(std::move(request));
+        if (onInsert) {
+            onInsert(int(requests.size()) - 1);
+        }
+        return true;
     }
 };

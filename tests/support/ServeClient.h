@@ -1,0 +1,123 @@
+#pragma once
+// Drives `delvix-host serve` as a separate process: starts it on a data folder on a free loopback
+// port, posts commands to its HTTP API and reads the streamed JSON lines, stops it with SIGTERM or
+// kills it with SIGKILL. Also reads a case vault file the way a person would check it afterwards.
+//
+// Threads: a ServeProcess belongs to the thread that made it; a ServeConnection too (each client
+// thread makes its own). Every limit is scaled for the build (TestWait.h).
+
+#include <QHash>
+#include <QJsonObject>
+#include <QList>
+#include <QNetworkAccessManager>
+#include <QNetworkReply>
+#include <QProcess>
+#include <QThread>
+#include <functional>
+#include <memory>
+#include <vector>
+
+// One answer of the API, filled as its lines arrive.
+struct ServeAnswer
+{
+    bool done = false;
+    int status = 0;
+    QNetworkReply::NetworkError error = QNetworkReply::NoError;
+    QList<QJsonObject> lines;
+
+    // The final line, or an empty object when none came.
+    QJsonObject finalLine() const;
+    QString code() const { return finalLine().value(QStringLiteral("code")).toString(); }
+    QJsonValue payload() const { return finalLine().value(QStringLiteral("payload")); }
+    int finalCount() const;
+};
+
+using ServeAnswerPtr = std::shared_ptr<ServeAnswer>;
+
+class ServeConnection
+{
+public:
+    explicit ServeConnection(quint16 port)
+        : m_port(port)
+    {}
+    // POST `body` to `path` ("/request", "/getCaseList?client=x", ...); the answer fills in while
+    // this thread's event loop turns.
+    ServeAnswerPtr post(const QString& path, const QByteArray& body);
+    // POST /request with the envelope; `wait` is how long the API waits for a first reply.
+    ServeAnswerPtr request(const QString& command, const QJsonValue& params, const QString& client,
+                           double wait = 60.0);
+    // Posts and waits for the answer to end.
+    ServeAnswer call(const QString& command, const QJsonValue& params,
+                     const QString& client = QStringLiteral("test"), double wait = 60.0);
+    static bool wait(const QList<ServeAnswerPtr>& answers);
+
+private:
+    quint16 m_port;
+    QNetworkAccessManager m_network;
+};
+
+class ServeProcess
+{
+public:
+    ~ServeProcess();
+    // Starts serve on `dataDir` (also its working directory) with `extra` arguments and waits
+    // until it listens. False when it did not: log() says why.
+    bool start(const QString& dataDir, const QStringList& extra = {});
+    quint16 port() const { return m_port; }
+    qint64 pid() const { return m_process.processId(); }
+    // SIGTERM; true when it ended by itself with status 0 within the limit.
+    bool stop();
+    // SIGKILL; true when it died of it.
+    bool kill();
+    // What it printed on stdout, and on stderr (a log file in the data folder).
+    QString output();
+    QString log() const;
+    // "stopping after N request(s)", once it stopped; -1 before.
+    int requestsServed();
+    // A field of /proc/PID/status in kB ("VmRSS", "VmHWM"); 0 when unreadable.
+    qint64 memoryKb(const char* field) const;
+    ServeConnection& http() { return *m_http; }
+
+private:
+    QProcess m_process;
+    QString m_logFile;
+    QByteArray m_output;
+    quint16 m_port = 0;
+    std::unique_ptr<ServeConnection> m_http;
+};
+
+// Client threads, body(index) on each, always joined before they go: a QThread destroyed while it
+// runs ends the program.
+class ClientThreads
+{
+public:
+    ClientThreads(int count, const std::function<void(int)>& body);
+    ~ClientThreads();
+    // Waits (turning this thread's event loop) until every body returned; false after the limit.
+    bool join(int limitMs);
+
+private:
+    std::vector<std::unique_ptr<QThread>> m_threads;
+};
+
+// One case item as a client sends it and as the vault keeps it.
+struct CaseEntry
+{
+    int caseId = 0;
+    QString caseName;
+    QString nodeId;
+    QString locId;
+    qint64 start = 0;
+    qint64 end = 0;
+    int type = 0;
+    bool needBookmark = false;
+
+    QJsonObject itemJson() const;
+    // Same item (case id and name compared only when both have one).
+    bool sameItem(const CaseEntry& other) const;
+};
+
+// Every item of a vault file with its case, by start time (unique in these tests), after an
+// integrity check. Opened read-write: the
+// first opener after a crash rolls back what was left unfinished. False with the reason.
+bool readVault(const QString& file, QHash<qint64, CaseEntry>* items, QString* error);

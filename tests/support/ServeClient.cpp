@@ -13,20 +13,20 @@
 #include <algorithm>
 #include <signal.h>
 
-QJsonObject ServeAnswer::finalLine() const
-{
-    for (const QJsonObject& line : lines) {
-        if (line.value(QStringLiteral("final")).toBool()) {
-            return line;
-        }
-    }
-    return QJsonObject();
-}
-
 int ServeAnswer::finalCount() const
 {
     return int(std::count_if(lines.cbegin(), lines.cend(),
                              [](const QJsonObject& l) { return l.value(QStringLiteral("final")).toBool(); }));
+}
+
+QString ServeAnswer::code() const
+{
+    return finalCount() > 0 ? lines.last().value(QStringLiteral("code")).toString() : QString();
+}
+
+QJsonValue ServeAnswer::payload() const
+{
+    return finalCount() > 0 ? lines.last().value(QStringLiteral("payload")) : QJsonValue();
 }
 
 ServeAnswerPtr ServeConnection::post(const QString& path, const QByteArray& body)
@@ -95,9 +95,8 @@ ServeProcess::~ServeProcess()
 
 bool ServeProcess::start(const QString& dataDir, const QStringList& extra)
 {
-    m_logFile = QDir(dataDir).filePath(QStringLiteral("serve.log"));
     m_process.setWorkingDirectory(dataDir);
-    m_process.setStandardErrorFile(m_logFile, QIODevice::Append);
+    m_process.setProcessChannelMode(QProcess::ForwardedErrorChannel);
     m_process.start(QStringLiteral(DELVIX_HOST_PATH),
                     QStringList{QStringLiteral("serve"), QStringLiteral("--data"), dataDir,
                                 QStringLiteral("--listen"), QStringLiteral("127.0.0.1:0")} +
@@ -106,13 +105,12 @@ bool ServeProcess::start(const QString& dataDir, const QStringList& extra)
     const QRegularExpression banner(QStringLiteral("http://127\\.0\\.0\\.1:(\\d+)"));
     waitFor(
         [&]() {
-            m_port = banner.match(output()).captured(1).toUShort();
+            m_output += m_process.readAllStandardOutput();
+            m_port = banner.match(QString::fromUtf8(m_output)).captured(1).toUShort();
             return m_port != 0 || m_process.state() == QProcess::NotRunning;
         },
         60000);
-    if (m_port != 0) {
-        m_http = std::make_unique<ServeConnection>(m_port);
-    }
+    m_http = std::make_unique<ServeConnection>(m_port);
     return m_port != 0;
 }
 
@@ -129,22 +127,11 @@ bool ServeProcess::kill()
     return m_process.waitForFinished(scaledMs(20000)) && m_process.exitStatus() == QProcess::CrashExit;
 }
 
-QString ServeProcess::output()
-{
-    m_output += m_process.readAllStandardOutput();
-    return QString::fromUtf8(m_output);
-}
-
-QString ServeProcess::log() const
-{
-    QFile file(m_logFile);
-    return file.open(QIODevice::ReadOnly) ? QString::fromUtf8(file.readAll()) : QString();
-}
-
 int ServeProcess::requestsServed()
 {
-    const QRegularExpressionMatch match =
-        QRegularExpression(QStringLiteral("stopping after (\\d+) request")).match(output());
+    m_output += m_process.readAllStandardOutput();
+    const QRegularExpressionMatch match = QRegularExpression(QStringLiteral("stopping after (\\d+) request"))
+                                              .match(QString::fromUtf8(m_output));
     return match.hasMatch() ? match.captured(1).toInt() : -1;
 }
 

@@ -1,14 +1,13 @@
 #pragma once
 // Drives `delvix-host serve` as a separate process: starts it on a data folder on a free loopback
 // port, posts commands to its HTTP API and reads the streamed JSON lines, stops it with SIGTERM or
-// kills it with SIGKILL. Also reads a case vault file the way a person would check it afterwards.
+// kills it with SIGKILL; and reads a case vault file the way a person checks it afterwards.
 //
-// Threads: a ServeProcess belongs to the thread that made it; a ServeConnection too (each client
-// thread makes its own). Every limit is scaled for the build (TestWait.h).
+// Threads: a ServeProcess and a ServeConnection belong to the thread that made them (each client
+// thread makes its own connection). Every limit is scaled for the build (TestWait.h).
 
 #include <QHash>
 #include <QJsonObject>
-#include <QList>
 #include <QNetworkAccessManager>
 #include <QNetworkReply>
 #include <QProcess>
@@ -25,13 +24,11 @@ struct ServeAnswer
     QNetworkReply::NetworkError error = QNetworkReply::NoError;
     QList<QJsonObject> lines;
 
-    // The final line, or an empty object when none came.
-    QJsonObject finalLine() const;
-    QString code() const { return finalLine().value(QStringLiteral("code")).toString(); }
-    QJsonValue payload() const { return finalLine().value(QStringLiteral("payload")); }
     int finalCount() const;
+    // The final line's code and payload (empty without one).
+    QString code() const;
+    QJsonValue payload() const;
 };
-
 using ServeAnswerPtr = std::shared_ptr<ServeAnswer>;
 
 class ServeConnection
@@ -40,10 +37,10 @@ public:
     explicit ServeConnection(quint16 port)
         : m_port(port)
     {}
-    // POST `body` to `path` ("/request", "/getCaseList?client=x", ...); the answer fills in while
-    // this thread's event loop turns.
+    // POST `body` to `path` ("/request", "/getCaseList?client=x"); the answer fills in while this
+    // thread's event loop turns.
     ServeAnswerPtr post(const QString& path, const QByteArray& body);
-    // POST /request with the envelope; `wait` is how long the API waits for a first reply.
+    // POST /request; `wait` is how long the API waits for a first reply.
     ServeAnswerPtr request(const QString& command, const QJsonValue& params, const QString& client,
                            double wait = 60.0);
     // Posts and waits for the answer to end.
@@ -56,44 +53,38 @@ private:
     QNetworkAccessManager m_network;
 };
 
+// Its stderr goes to the test's, so that a failing test shows what the server said.
 class ServeProcess
 {
 public:
     ~ServeProcess();
-    // Starts serve on `dataDir` (also its working directory) with `extra` arguments and waits
-    // until it listens. False when it did not: log() says why.
+    // Starts serve on `dataDir` (also its working directory) and waits until it listens.
     bool start(const QString& dataDir, const QStringList& extra = {});
     quint16 port() const { return m_port; }
-    qint64 pid() const { return m_process.processId(); }
-    // SIGTERM; true when it ended by itself with status 0 within the limit.
+    ServeConnection& http() { return *m_http; }
+    // SIGTERM: true when it ended by itself with status 0. SIGKILL: true when it died of it.
     bool stop();
-    // SIGKILL; true when it died of it.
     bool kill();
-    // What it printed on stdout, and on stderr (a log file in the data folder).
-    QString output();
-    QString log() const;
-    // "stopping after N request(s)", once it stopped; -1 before.
+    // "stopping after N request(s)" once stopped, else -1.
     int requestsServed();
     // A field of /proc/PID/status in kB ("VmRSS", "VmHWM"); 0 when unreadable.
     qint64 memoryKb(const char* field) const;
-    ServeConnection& http() { return *m_http; }
 
 private:
     QProcess m_process;
-    QString m_logFile;
     QByteArray m_output;
     quint16 m_port = 0;
     std::unique_ptr<ServeConnection> m_http;
 };
 
-// Client threads, body(index) on each, always joined before they go: a QThread destroyed while it
-// runs ends the program.
+// Threads running body(index), always joined before they go (a QThread destroyed while it runs
+// ends the program).
 class ClientThreads
 {
 public:
     ClientThreads(int count, const std::function<void(int)>& body);
     ~ClientThreads();
-    // Waits (turning this thread's event loop) until every body returned; false after the limit.
+    // Waits, turning this thread's event loop, until every body returned.
     bool join(int limitMs);
 
 private:
@@ -113,11 +104,11 @@ struct CaseEntry
     bool needBookmark = false;
 
     QJsonObject itemJson() const;
-    // Same item (case id and name compared only when both have one).
+    // Same item; case id and name compared only when both have one.
     bool sameItem(const CaseEntry& other) const;
 };
 
-// Every item of a vault file with its case, by start time (unique in these tests), after an
-// integrity check. Opened read-write: the
-// first opener after a crash rolls back what was left unfinished. False with the reason.
+// The items of a vault file with their cases, by start time (unique in these tests), after an
+// integrity check. Opened read-write: the first opener after a crash rolls back what was left
+// unfinished. False with the reason.
 bool readVault(const QString& file, QHash<qint64, CaseEntry>* items, QString* error);

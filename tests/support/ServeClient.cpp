@@ -16,23 +16,13 @@
 int ServeAnswer::finalCount() const
 {
     return int(std::count_if(lines.cbegin(), lines.cend(),
-                             [](const QJsonObject& l) { return l.value(QStringLiteral("final")).toBool(); }));
-}
-
-QString ServeAnswer::code() const
-{
-    return finalCount() > 0 ? lines.last().value(QStringLiteral("code")).toString() : QString();
-}
-
-QJsonValue ServeAnswer::payload() const
-{
-    return finalCount() > 0 ? lines.last().value(QStringLiteral("payload")) : QJsonValue();
+                             [](const QJsonObject& l) { return l.value("final").toBool(); }));
 }
 
 ServeAnswerPtr ServeConnection::post(const QString& path, const QByteArray& body)
 {
     QNetworkRequest request(QUrl(QStringLiteral("http://127.0.0.1:%1%2").arg(m_port).arg(path)));
-    request.setHeader(QNetworkRequest::ContentTypeHeader, QStringLiteral("application/json"));
+    request.setHeader(QNetworkRequest::ContentTypeHeader, "application/json");
     // Generous: an answer still open after this is a lost reply, not a slow one.
     request.setTransferTimeout(scaledMs(120000));
     auto answer = std::make_shared<ServeAnswer>();
@@ -61,11 +51,8 @@ ServeAnswerPtr ServeConnection::post(const QString& path, const QByteArray& body
 ServeAnswerPtr ServeConnection::request(const QString& command, const QJsonValue& params,
                                         const QString& client, double wait)
 {
-    const QJsonObject envelope{{QStringLiteral("command"), command},
-                               {QStringLiteral("client"), client},
-                               {QStringLiteral("params"), params},
-                               {QStringLiteral("wait"), wait}};
-    return post(QStringLiteral("/request"), QJsonDocument(envelope).toJson(QJsonDocument::Compact));
+    const QJsonObject envelope{{"command", command}, {"client", client}, {"params", params}, {"wait", wait}};
+    return post("/request", QJsonDocument(envelope).toJson(QJsonDocument::Compact));
 }
 
 ServeAnswer ServeConnection::call(const QString& command, const QJsonValue& params, const QString& client,
@@ -86,7 +73,6 @@ bool ServeConnection::wait(const QList<ServeAnswerPtr>& answers)
 
 ServeProcess::~ServeProcess()
 {
-    m_http.reset();
     if (m_process.state() != QProcess::NotRunning) {
         m_process.kill();
         m_process.waitForFinished();
@@ -98,11 +84,9 @@ bool ServeProcess::start(const QString& dataDir, const QStringList& extra)
     m_process.setWorkingDirectory(dataDir);
     m_process.setProcessChannelMode(QProcess::ForwardedErrorChannel);
     m_process.start(QStringLiteral(DELVIX_HOST_PATH),
-                    QStringList{QStringLiteral("serve"), QStringLiteral("--data"), dataDir,
-                                QStringLiteral("--listen"), QStringLiteral("127.0.0.1:0")} +
-                        extra);
+                    QStringList{"serve", "--data", dataDir, "--listen", "127.0.0.1:0"} + extra);
     // The banner names the port the system gave it.
-    const QRegularExpression banner(QStringLiteral("http://127\\.0\\.0\\.1:(\\d+)"));
+    const QRegularExpression banner("http://127\\.0\\.0\\.1:(\\d+)");
     waitFor(
         [&]() {
             m_output += m_process.readAllStandardOutput();
@@ -130,8 +114,8 @@ bool ServeProcess::kill()
 int ServeProcess::requestsServed()
 {
     m_output += m_process.readAllStandardOutput();
-    const QRegularExpressionMatch match = QRegularExpression(QStringLiteral("stopping after (\\d+) request"))
-                                              .match(QString::fromUtf8(m_output));
+    const QRegularExpressionMatch match =
+        QRegularExpression("stopping after (\\d+) request").match(QString::fromUtf8(m_output));
     return match.hasMatch() ? match.captured(1).toInt() : -1;
 }
 
@@ -172,12 +156,12 @@ bool ClientThreads::join(int limitMs)
 
 QJsonObject CaseEntry::itemJson() const
 {
-    return {{QStringLiteral("nodeID"), nodeId},
-            {QStringLiteral("locID"), locId},
-            {QStringLiteral("startTimestamp"), double(start)},
-            {QStringLiteral("endTimestamp"), double(end)},
-            {QStringLiteral("caseItemType"), type},
-            {QStringLiteral("needBookmark"), needBookmark}};
+    return {{"nodeID", nodeId},
+            {"locID", locId},
+            {"startTimestamp", double(start)},
+            {"endTimestamp", double(end)},
+            {"caseItemType", type},
+            {"needBookmark", needBookmark}};
 }
 
 bool CaseEntry::sameItem(const CaseEntry& other) const
@@ -193,14 +177,14 @@ bool readVault(const QString& file, QHash<qint64, CaseEntry>* items, QString* er
     const QString connection = QStringLiteral("vault-") + file;
     bool ok = false;
     {
-        QSqlDatabase database = QSqlDatabase::addDatabase(QStringLiteral("QSQLITE"), connection);
+        QSqlDatabase database = QSqlDatabase::addDatabase("QSQLITE", connection);
         database.setDatabaseName(file);
         // Never made by opening: a missing vault is a fault.
         const bool open = QFile::exists(file) && database.open();
         QSqlQuery query(database);
         if (!open) {
             *error = QStringLiteral("cannot open: ") + database.lastError().text();
-        } else if (!query.exec(QStringLiteral("PRAGMA integrity_check")) || !query.next() ||
+        } else if (!query.exec("PRAGMA integrity_check") || !query.next() ||
                    query.value(0).toString() != QLatin1String("ok")) {
             *error = QStringLiteral("integrity check: ") + query.value(0).toString();
         } else if (!query.exec(QStringLiteral(

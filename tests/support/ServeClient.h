@@ -25,9 +25,9 @@ struct ServeAnswer
     QList<QJsonObject> lines;
 
     int finalCount() const;
-    // The final line's code and payload (empty without one).
-    QString code() const;
-    QJsonValue payload() const;
+    // The final line's code and payload (empty without one); the final line is the last.
+    QString code() const { return finalCount() ? lines.last()["code"].toString() : QString(); }
+    QJsonValue payload() const { return finalCount() ? lines.last()["payload"] : QJsonValue(); }
 };
 using ServeAnswerPtr = std::shared_ptr<ServeAnswer>;
 

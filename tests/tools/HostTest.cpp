@@ -1,6 +1,6 @@
 // `delvix-host` as a person runs it, a real process: the serve API (streamed JSON lines, bookmarks
-// on a remote server through the relay, clear errors, a clean stop on SIGTERM), its refusals, the
-// demo, and a host killed while clients write cases.
+// on a remote server through the relay, clear errors, a clean stop on SIGTERM), its refusal of a
+// non-loopback address, the demo, and a host killed while clients write cases.
 
 #include "ServeClient.h"
 #include "TestWait.h"
@@ -30,42 +30,40 @@ TEST(HostServe, StreamsJsonLinesRelaysRemoteBookmarksAndStopsCleanly)
 {
     QTemporaryDir data;
     // A remote server behind the relay, for a recording bookmarked there.
-    writeFile(data.filePath(QStringLiteral("host.json")), R"({"remoteServers":["east"]})");
+    writeFile(data.filePath("host.json"), R"({"remoteServers":["east"]})");
     ServeProcess serve;
     ASSERT_TRUE(serve.start(data.path()));
     ServeConnection& http = serve.http();
 
-    ServeAnswer answer = http.call(QStringLiteral("noSuchCommand"), QJsonValue(), QStringLiteral("alice"));
+    ServeAnswer answer = http.call("noSuchCommand", QJsonValue(), "alice");
     EXPECT_EQ(answer.status, 200);
     ASSERT_EQ(answer.lines.size(), 1);
-    EXPECT_EQ(answer.code(), QStringLiteral("commandNotSupportError"));
+    EXPECT_EQ(answer.code(), "commandNotSupportError");
 
     // A case made through the path form: a progress line, then the final line with the case, which
     // the case list shows with the time it was made.
     const qint64 before = QDateTime::currentSecsSinceEpoch();
     ServeAnswerPtr made =
-        http.post(QStringLiteral("/addCaseWithItem?client=bob"),
+        http.post("/addCaseWithItem?client=bob",
                   R"({"caseName":"Theft","caseItem":{"nodeID":"cam1","needBookmark":false}})");
     ASSERT_TRUE(ServeConnection::wait({made}));
     ASSERT_EQ(made->lines.size(), 2);
-    EXPECT_FALSE(made->lines[0].value(QStringLiteral("final")).toBool());
-    EXPECT_EQ(made->payload()[QStringLiteral("caseName")], QStringLiteral("Theft"));
-    answer = http.call(QStringLiteral("getCaseList"), QJsonObject());
+    EXPECT_FALSE(made->lines[0].value("final").toBool());
+    EXPECT_EQ(made->payload()["caseName"], "Theft");
+    answer = http.call("getCaseList", QJsonObject());
     ASSERT_EQ(answer.payload().toArray().size(), 1);
-    EXPECT_GE(answer.payload()[0][QStringLiteral("createdTime")].toInteger(), before);
+    EXPECT_GE(answer.payload()[0]["createdTime"].toInteger(), before);
 
-    const CaseEntry remote{
-        0, {}, QStringLiteral("east/Cam7"), QStringLiteral("Loc9"), 1796540000000, 1796540600000, 1, true};
-    answer = http.call(QStringLiteral("addCaseWithRecordings"),
-                       QJsonObject{{QStringLiteral("caseName"), QStringLiteral("Clips")},
-                                   {QStringLiteral("caseItem"), QJsonArray{remote.itemJson()}}});
-    EXPECT_EQ(answer.code(), QStringLiteral("0"));
-    QFile remoteBookmarks(data.filePath(QStringLiteral("remotes/65617374/bookmarks.json"))); // "east" in hex
+    const CaseEntry remote{0, {}, "east/Cam7", "Loc9", 1796540000000, 1796540600000, 1, true};
+    answer = http.call("addCaseWithRecordings",
+                       QJsonObject{{"caseName", "Clips"}, {"caseItem", QJsonArray{remote.itemJson()}}});
+    EXPECT_EQ(answer.code(), "0");
+    QFile remoteBookmarks(data.filePath("remotes/65617374/bookmarks.json")); // "east" in hex
     ASSERT_TRUE(remoteBookmarks.open(QIODevice::ReadOnly));
     EXPECT_TRUE(remoteBookmarks.readAll().contains("Cam7"));
 
     // A command that sends no reply ends its answer after the wait, with no line.
-    answer = http.call(QStringLiteral("stopSearch"), QJsonObject(), QStringLiteral("bob"), 0.2);
+    answer = http.call("stopSearch", QJsonObject(), "bob", 0.2);
     EXPECT_EQ(answer.status, 200);
     EXPECT_TRUE(answer.lines.isEmpty());
     for (const auto& [path, body] : {std::pair{"/request", "not json"},
@@ -79,35 +77,22 @@ TEST(HostServe, StreamsJsonLinesRelaysRemoteBookmarksAndStopsCleanly)
     EXPECT_EQ(serve.requestsServed(), 5);
 }
 
-TEST(HostServe, RefusesNonLoopbackAddressesAndBadOptions)
+TEST(HostServe, RefusesANonLoopbackAddress)
 {
     QTemporaryDir data;
-    const struct
-    {
-        QStringList args;
-        int code; // -1: any failure
-        const char* says;
-    } cases[] = {
-        {{QStringLiteral("--listen"), QStringLiteral("0.0.0.0:8000")}, -1, "loopback"},
-        {{QStringLiteral("--listen"), QStringLiteral("nonsense")}, 2, "--listen"},
-        {{QStringLiteral("--site"), data.filePath(QStringLiteral("missing.json"))}, -1, "missing.json"}};
-    for (const auto& c : cases) {
-        QProcess process;
-        process.start(QStringLiteral(DELVIX_HOST_PATH),
-                      QStringList{QStringLiteral("serve"), QStringLiteral("--data"), data.path()} + c.args);
-        ASSERT_TRUE(process.waitForFinished(scaledMs(30000)));
-        const QByteArray err = process.readAllStandardError();
-        EXPECT_TRUE(c.code < 0 ? process.exitCode() != 0 : process.exitCode() == c.code) << err.constData();
-        EXPECT_TRUE(err.contains(c.says)) << err.constData();
-    }
+    QProcess process;
+    process.start(QStringLiteral(DELVIX_HOST_PATH),
+                  {"serve", "--data", data.path(), "--listen", "0.0.0.0:8000"});
+    ASSERT_TRUE(process.waitForFinished(scaledMs(30000)));
+    EXPECT_NE(process.exitCode(), 0);
+    EXPECT_TRUE(process.readAllStandardError().contains("loopback"));
 }
 
 TEST(HostDemo, RunsTheWholeSystemAndEveryStepFindsSomething)
 {
     QTemporaryDir data;
     QProcess process;
-    process.start(QStringLiteral(DELVIX_HOST_PATH),
-                  {QStringLiteral("demo"), QStringLiteral("--data"), data.filePath(QStringLiteral("demo"))});
+    process.start(QStringLiteral(DELVIX_HOST_PATH), {"demo", "--data", data.filePath("demo")});
     ASSERT_TRUE(process.waitForFinished(scaledMs(110000)));
     const QString out = QString::fromUtf8(process.readAllStandardOutput());
     EXPECT_EQ(process.exitCode(), 0) << qPrintable(out) << process.readAllStandardError().constData();
@@ -118,7 +103,7 @@ TEST(HostDemo, RunsTheWholeSystemAndEveryStepFindsSomething)
         EXPECT_GT(line.match(out).captured(1).toInt(), 0) << step;
     }
     EXPECT_TRUE(out.contains(QLatin1String("bookmarks left: 0")));
-    EXPECT_TRUE(QFile::exists(data.filePath(QStringLiteral("demo/database/PluginDelvix/CaseVault.db"))));
+    EXPECT_TRUE(QFile::exists(data.filePath("demo/database/PluginDelvix/CaseVault.db")));
 }
 
 namespace {
@@ -156,26 +141,25 @@ void writeUntilKilled(int writer, quint16 port, KillRun* run)
     QList<CaseEntry> cases;
     for (int sequence = 1;; ++sequence) {
         QList<CaseEntry> items{newEntry(writer, sequence)};
-        QString command = QStringLiteral("addCaseItem");
+        QString command = "addCaseItem";
         QJsonObject params;
         if (cases.isEmpty() || sequence % 4 < 2) {
             items[0].caseName = QStringLiteral("killed host %1 case %2").arg(writer).arg(sequence);
-            params = {{QStringLiteral("caseName"), items[0].caseName},
-                      {QStringLiteral("caseItem"), items[0].itemJson()}};
-            command = QStringLiteral("addCaseWithItem");
+            params = {{"caseName", items[0].caseName}, {"caseItem", items[0].itemJson()}};
+            command = "addCaseWithItem";
             if (sequence % 4 == 1) {
-                command = QStringLiteral("addCaseWithRecordings");
+                command = "addCaseWithRecordings";
                 items << newEntry(writer, sequence, 1);
                 items[0].type = items[1].type = 1;
                 items[1].caseName = items[0].caseName;
-                params[QStringLiteral("caseItem")] = QJsonArray{items[0].itemJson(), items[1].itemJson()};
+                params["caseItem"] = QJsonArray{items[0].itemJson(), items[1].itemJson()};
             }
         } else {
             const CaseEntry& owner = cases.at(sequence % cases.size());
             items[0].caseId = owner.caseId;
             items[0].caseName = owner.caseName;
             params = items[0].itemJson();
-            params[QStringLiteral("caseId")] = owner.caseId;
+            params["caseId"] = owner.caseId;
         }
         const ServeAnswer answer = http.call(command, params, QStringLiteral("writer-%1").arg(writer));
         if (answer.finalCount() == 0) {
@@ -187,7 +171,7 @@ void writeUntilKilled(int writer, quint16 port, KillRun* run)
         }
         if (items[0].caseId == 0) {
             for (CaseEntry& item : items) {
-                item.caseId = answer.payload()[QStringLiteral("caseId")].toInt();
+                item.caseId = answer.payload()["caseId"].toInt();
             }
             cases << items[0];
         }
@@ -210,10 +194,11 @@ TEST(HostKill, AcknowledgedCaseWritesSurviveSigkillAndAFreshHostServesThem)
         ServeProcess serve;
         ASSERT_TRUE(serve.start(data->path()));
         ClientThreads writers(kWriters, [&](int i) { writeUntilKilled(i, serve.port(), run.get()); });
-        ASSERT_TRUE(waitFor([&]() { return run->count >= kAcknowledgedBeforeKill; }, 120000))
-            << run->count << " writes acknowledged";
+        const bool enough = waitFor([&]() { return run->count >= kAcknowledgedBeforeKill; }, 120000);
+        // Killed before any check: the writers end only with the host.
         ASSERT_TRUE(serve.kill());
         ASSERT_TRUE(writers.join(60000));
+        ASSERT_TRUE(enough) << run->count << " writes acknowledged";
     }
     // An instrumented client reads its replies so late that the host has often answered every write
     // by the kill; what was acknowledged is checked all the same.
@@ -223,8 +208,7 @@ TEST(HostKill, AcknowledgedCaseWritesSurviveSigkillAndAFreshHostServesThem)
 
     QHash<qint64, CaseEntry> vault;
     QString error;
-    ASSERT_TRUE(
-        readVault(data->filePath(QStringLiteral("database/PluginDelvix/CaseVault.db")), &vault, &error))
+    ASSERT_TRUE(readVault(data->filePath("database/PluginDelvix/CaseVault.db"), &vault, &error))
         << qPrintable(error);
     QMap<int, int> itemsOfCase;
     for (const CaseEntry& sent : std::as_const(run->acknowledged)) {
@@ -236,24 +220,23 @@ TEST(HostKill, AcknowledgedCaseWritesSurviveSigkillAndAFreshHostServesThem)
     // A fresh host on the same folder lists every case with items, reads one back whole and takes more.
     ServeProcess again;
     ASSERT_TRUE(again.start(data->path()));
-    const ServeAnswer list = again.http().call(QStringLiteral("getCaseList"), QJsonObject());
-    ASSERT_EQ(list.code(), QStringLiteral("0"));
+    const ServeAnswer list = again.http().call("getCaseList", QJsonObject());
+    ASSERT_EQ(list.code(), "0");
     QSet<int> listed;
     for (const QJsonValue& summary : list.payload().toArray()) {
-        listed.insert(summary[QStringLiteral("caseId")].toInt());
+        listed.insert(summary["caseId"].toInt());
     }
     for (const CaseEntry& stored : std::as_const(vault)) {
         EXPECT_TRUE(listed.contains(stored.caseId)) << "case " << stored.caseId;
     }
     const auto busiest = std::max_element(itemsOfCase.cbegin(), itemsOfCase.cend());
-    const ServeAnswer model = again.http().call(QStringLiteral("retrieveCaseItemModel"), busiest.key());
-    EXPECT_EQ(model.code(), QStringLiteral("0"));
-    EXPECT_GE(model.payload()[QStringLiteral("caseItemList")].toArray().size(), busiest.value());
+    const ServeAnswer model = again.http().call("retrieveCaseItemModel", busiest.key());
+    EXPECT_EQ(model.code(), "0");
+    EXPECT_GE(model.payload()["caseItemList"].toArray().size(), busiest.value());
     const ServeAnswer fresh =
-        again.http().call(QStringLiteral("addCaseWithItem"),
-                          QJsonObject{{QStringLiteral("caseName"), QStringLiteral("after the kill")},
-                                      {QStringLiteral("caseItem"), newEntry(9, 1).itemJson()}});
-    EXPECT_EQ(fresh.code(), QStringLiteral("0"));
-    EXPECT_EQ(fresh.payload()[QStringLiteral("caseName")], QStringLiteral("after the kill"));
+        again.http().call("addCaseWithItem", QJsonObject{{"caseName", "after the kill"},
+                                                         {"caseItem", newEntry(9, 1).itemJson()}});
+    EXPECT_EQ(fresh.code(), "0");
+    EXPECT_EQ(fresh.payload()["caseName"], "after the kill");
     EXPECT_TRUE(again.stop());
 }

@@ -93,16 +93,14 @@ private:
     void send(int kind)
     {
         if (kind < 2 || (kind == 2 && m_feature.isEmpty())) {
-            search(QStringLiteral("startSearch"), kind == 1);
+            search("startSearch", kind == 1);
         } else if (kind == 2) {
-            search(QStringLiteral("startReIdSearch"), pickUpTo(3) == 0);
+            search("startReIdSearch", pickUpTo(3) == 0);
         } else if (kind == 5 && !m_cases.isEmpty() && pickUpTo(2) == 0) {
             const int caseId = m_cases.at(pickUpTo(int(m_cases.size()))).first.caseId;
-            finished(QStringLiteral("retrieveCaseItemModel"),
-                     m_http.call(QStringLiteral("retrieveCaseItemModel"), caseId, m_name));
+            finished("retrieveCaseItemModel", m_http.call("retrieveCaseItemModel", caseId, m_name));
         } else if (kind == 5) {
-            finished(QStringLiteral("getCaseList"),
-                     m_http.call(QStringLiteral("getCaseList"), QJsonObject(), m_name));
+            finished("getCaseList", m_http.call("getCaseList", QJsonObject(), m_name));
         } else {
             write(kind == 4);
         }
@@ -114,10 +112,8 @@ private:
     {
         const bool clean = answer.status == 200 && answer.error == QNetworkReply::NoError &&
                            answer.finalCount() == (stop ? 0 : 1) &&
-                           (stop || answer.lines.last()[QStringLiteral("final")].toBool());
-        ++m_stats
-              .counts[stop ? command
-                           : command + QLatin1Char(' ') + (clean ? answer.code() : QStringLiteral("lost"))];
+                           (stop || answer.lines.last()["final"].toBool());
+        ++m_stats.counts[stop ? command : command + QLatin1Char(' ') + (clean ? answer.code() : "lost")];
         if (!clean) {
             m_stats.faults << QStringLiteral("%1 %2: did not end as it must (HTTP %3, error %4, %5 line(s))")
                                   .arg(m_name, command)
@@ -135,13 +131,13 @@ private:
         const qint64 length = stop || reId ? 3600 * 1000LL : 600 * 1000LL;
         const qint64 start =
             kSeedStartMs + std::uniform_int_distribution<qint64>(0, kSeedSpanMs - length)(m_random);
-        QJsonObject params{{QStringLiteral("startTimestamp"), double(start)},
-                           {QStringLiteral("endTimestamp"), double(start + length)},
-                           {QStringLiteral("locIDList"), QJsonArray{m_location}}};
+        QJsonObject params{{"startTimestamp", double(start)},
+                           {"endTimestamp", double(start + length)},
+                           {"locIDList", QJsonArray{m_location}}};
         if (reId) {
-            params[QStringLiteral("feature")] = m_feature;
+            params["feature"] = m_feature;
         } else if (pickUpTo(2) == 0) {
-            params[QStringLiteral("humanInfo")] = QStringLiteral("{\"Gender\":%1}").arg(1 + pickUpTo(2));
+            params["humanInfo"] = QStringLiteral("{\"Gender\":%1}").arg(1 + pickUpTo(2));
         }
         // Stopped searches go under a second name: a stop's answer ends before the plug-in may have
         // handled it, and a late stop must not reach this client's next search.
@@ -150,8 +146,7 @@ private:
         if (stop) {
             const qint64 until = now() + 10 + pickUpTo(150); // let the search start
             waitFor([until]() { return now() >= until; });
-            const QString stopCommand =
-                reId ? QStringLiteral("stopReIdSearch") : QStringLiteral("stopSearch");
+            const QString stopCommand = reId ? "stopReIdSearch" : "stopSearch";
             finished(stopCommand, m_http.call(stopCommand, QJsonObject(), name, 0.2), true);
         }
         ServeConnection::wait({answer});
@@ -160,19 +155,18 @@ private:
         }
         // Every hit from this client's own location, overlapping its window (the store keeps seconds).
         for (const QJsonObject& line : std::as_const(answer->lines).mid(0, answer->lines.size() - 1)) {
-            const QJsonObject hit = line[QStringLiteral("payload")].toObject();
-            const qint64 hitStart = hit[QStringLiteral("startTimestamp")].toInteger();
-            const qint64 hitEnd = hit[QStringLiteral("endTimestamp")].toInteger(hitStart);
-            ++m_stats.counts[QStringLiteral("hits")];
-            if (hit[QStringLiteral("locID")] != m_location || hitStart > start + length + 999 ||
-                hitEnd < start - 999) {
+            const QJsonObject hit = line["payload"].toObject();
+            const qint64 hitStart = hit["startTimestamp"].toInteger();
+            const qint64 hitEnd = hit["endTimestamp"].toInteger(hitStart);
+            ++m_stats.counts["hits"];
+            if (hit["locID"] != m_location || hitStart > start + length + 999 || hitEnd < start - 999) {
                 m_stats.faults << QStringLiteral("%1 %2 at %3 from %4: foreign hit %5")
                                       .arg(m_name, command, m_location)
                                       .arg(start)
                                       .arg(QString::fromUtf8(
                                           QJsonDocument(hit).toJson(QJsonDocument::Compact).left(200)));
-            } else if (hit[QStringLiteral("feature")].toArray().size() == 512) {
-                m_feature = hit[QStringLiteral("feature")].toArray();
+            } else if (hit["feature"].toArray().size() == 512) {
+                m_feature = hit["feature"].toArray();
             }
         }
         if (!stop && m_stats.replays.size() < 6) {
@@ -193,9 +187,7 @@ private:
                        kSeedStartMs + m_index * 1000000000LL + m_sequence * 1000LL + 60000,
                        pickUpTo(2),
                        pickUpTo(4) == 0};
-        QJsonObject params{{QStringLiteral("caseName"), item.caseName},
-                           {QStringLiteral("reporter"), m_name},
-                           {QStringLiteral("caseItem"), item.itemJson()}};
+        QJsonObject params{{"caseName", item.caseName}, {"reporter", m_name}, {"caseItem", item.itemJson()}};
         QList<CaseEntry> owners;
         for (const auto& [owner, vault] : std::as_const(m_cases)) {
             if ((before == 0 && vault == OldVault) || (before == 2 && vault == NewVault)) {
@@ -207,10 +199,9 @@ private:
             item.caseId = owner.caseId;
             item.caseName = owner.caseName;
             params = item.itemJson();
-            params[QStringLiteral("caseId")] = item.caseId;
+            params["caseId"] = item.caseId;
         }
-        const QString command =
-            item.caseId ? QStringLiteral("addCaseItem") : QStringLiteral("addCaseWithItem");
+        const QString command = item.caseId ? "addCaseItem" : "addCaseWithItem";
         const ServeAnswer answer = m_http.call(command, params, m_name, kFirstReplyWait);
         const int after = m_phase->load();
         if (!finished(command, answer)) {
@@ -218,8 +209,8 @@ private:
         }
         const Vault vault = before == 0 && after == 0 ? OldVault : before == 2 ? NewVault : EitherVault;
         if (item.caseId == 0) {
-            item.caseId = answer.payload()[QStringLiteral("caseId")].toInt();
-            if (item.caseId <= 0 || answer.payload()[QStringLiteral("caseName")] != item.caseName) {
+            item.caseId = answer.payload()["caseId"].toInt();
+            if (item.caseId <= 0 || answer.payload()["caseName"] != item.caseName) {
                 m_stats.faults
                     << QStringLiteral("%1 %2: acknowledged with a wrong case").arg(m_name, command);
                 return;
@@ -274,36 +265,31 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     const qint64 seedStart = now();
     QProcess seed;
     seed.start(QStringLiteral(DELVIX_HOST_PATH),
-               {QStringLiteral("seed"), QStringLiteral("--data"), data.path(), QStringLiteral("--objects"),
-                QString::number(objects), QStringLiteral("--locations"), QString::number(clients),
-                QStringLiteral("--seed"), QStringLiteral("7")});
+               {"seed", "--data", data.path(), "--objects", QString::number(objects), "--locations",
+                QString::number(clients), "--seed", "7"});
     ASSERT_TRUE(seed.waitForFinished(scaledMs(1800000)));
     ASSERT_EQ(seed.exitCode(), 0) << seed.readAllStandardError().constData();
     const double seedSeconds = double(now() - seedStart) / 1000.0;
 
     // The synchroniser reads its settings from the working directory: a pass every 2 s.
-    ASSERT_TRUE(writeFile(dir.filePath(QStringLiteral("routineSyncTimeBuffer.txt")), "2\n"));
-    ASSERT_TRUE(writeFile(dir.filePath(QStringLiteral("getObjectDataTimeBuffer.txt")), "0\n"));
-    QStringList siteLocations{QStringLiteral("Loc1"), QStringLiteral("Loc2"), QStringLiteral("Loc3"),
-                              QStringLiteral("Loc4"),
-                              QStringLiteral("Loc5")}; // the built-in site's that record
+    ASSERT_TRUE(writeFile(dir.filePath("routineSyncTimeBuffer.txt"), "2\n"));
+    ASSERT_TRUE(writeFile(dir.filePath("getObjectDataTimeBuffer.txt"), "0\n"));
+    QStringList siteLocations{"Loc1", "Loc2", "Loc3", "Loc4", "Loc5"}; // the built-in site's that record
     QStringList extra;
     if (cameras > 0) {
-        QJsonArray list;
+        // Distinct ports make distinct cameras; the host replaces them with free ones.
+        QStringList list;
         siteLocations.clear();
         for (int i = 1; i <= cameras; ++i) {
-            // Distinct ports make distinct cameras; the host replaces them with free ones.
             siteLocations << QStringLiteral("Loc%1").arg(i);
-            list.append(QJsonObject{{QStringLiteral("name"), QStringLiteral("Cam%1").arg(i)},
-                                    {QStringLiteral("port"), 20000 + i},
-                                    {QStringLiteral("user"), QStringLiteral("admin")},
-                                    {QStringLiteral("password"), QStringLiteral("cam-%1-pw").arg(i)},
-                                    {QStringLiteral("location"), siteLocations.last()},
-                                    {QStringLiteral("groupId"), 1 + i % 4}});
+            list << QStringLiteral(R"({"name":"Cam%1","port":%2,"user":"admin","password":"cam-%1-pw",)"
+                                   R"("location":"Loc%1","groupId":%3})")
+                        .arg(i)
+                        .arg(20000 + i)
+                        .arg(1 + i % 4);
         }
-        extra << QStringLiteral("--site") << dir.filePath(QStringLiteral("site.json"));
-        ASSERT_TRUE(
-            writeFile(extra.last(), QJsonDocument(QJsonObject{{QStringLiteral("cameras"), list}}).toJson()));
+        extra << "--site" << dir.filePath("site.json");
+        ASSERT_TRUE(writeFile(extra.last(), "{\"cameras\":[" + list.join(',').toUtf8() + "]}"));
     }
 
     ServeProcess serve;
@@ -321,9 +307,8 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
         settledKb = serve.memoryKb("VmRSS");
         waitFor([&]() { return now() >= serveStart + seconds * 500; }, seconds * 1000);
         phase = 1;
-        const QJsonObject moveTo{{QStringLiteral("path"), dir.filePath(QStringLiteral("database2"))}};
-        const ServeAnswerPtr move =
-            serve.http().post(QStringLiteral("/host/databasePath"), QJsonDocument(moveTo).toJson());
+        const QJsonObject moveTo{{"path", dir.filePath("database2")}};
+        const ServeAnswerPtr move = serve.http().post("/host/databasePath", QJsonDocument(moveTo).toJson());
         ServeConnection::wait({move});
         EXPECT_EQ(move->status, 200);
         phase = 2;
@@ -341,19 +326,15 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     }
 
     // The synchroniser ran meanwhile: what the site's cameras recorded in this run is in the store.
-    const QJsonObject recent{{QStringLiteral("startTimestamp"), double(serveStart - 3600 * 1000LL)},
-                             {QStringLiteral("endTimestamp"), double(now())},
-                             {QStringLiteral("locIDList"), QJsonArray::fromStringList(siteLocations)}};
+    const QJsonObject recent{{"startTimestamp", double(serveStart - 3600 * 1000LL)},
+                             {"endTimestamp", double(now())},
+                             {"locIDList", QJsonArray::fromStringList(siteLocations)}};
     const qsizetype synchronised =
-        serve.http()
-            .call(QStringLiteral("startSearch"), recent, QStringLiteral("sync"), kFirstReplyWait)
-            .lines.size() -
-        1;
+        serve.http().call("startSearch", recent, "sync", kFirstReplyWait).lines.size() - 1;
     EXPECT_GT(synchronised, 0) << "nothing the cameras recorded during the run was found";
     // The unstopped searches again, one at a time: each finds exactly what it found under load.
     for (const Replay& replay : std::as_const(total.replays)) {
-        const ServeAnswer again =
-            serve.http().call(replay.command, replay.params, QStringLiteral("replay"), kFirstReplyWait);
+        const ServeAnswer again = serve.http().call(replay.command, replay.params, "replay", kFirstReplyWait);
         if (again.lines.size() - 1 != replay.hits) {
             total.faults << QStringLiteral("%1 with %2 hit(s) under load finds %3 alone: %4")
                                 .arg(replay.command)
@@ -370,8 +351,8 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     QHash<qint64, CaseEntry> vaults[2];
     for (const int second : {0, 1}) {
         QString error;
-        const QString file = dir.filePath(second ? QStringLiteral("database2/PluginDelvix/CaseVault.db")
-                                                 : QStringLiteral("database/PluginDelvix/CaseVault.db"));
+        const QString file = dir.filePath(second ? "database2/PluginDelvix/CaseVault.db"
+                                                 : "database/PluginDelvix/CaseVault.db");
         EXPECT_TRUE(readVault(file, &vaults[second], &error))
             << qPrintable(file) << ": " << qPrintable(error);
     }
@@ -402,7 +383,7 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
         "  synchroniser: %lld objects of this run found at the site's locations\n"
         "  server memory: peak RSS %.1f MB, a quarter in %.1f MB, at the end %.1f MB\n",
         clients, seconds, objects, seedSeconds, cameras, sent, serve.requestsServed(), sent / loadSeconds,
-        loadSeconds, qPrintable(mix.join(QStringLiteral(", "))), static_cast<long long>(total.written.size()),
+        loadSeconds, qPrintable(mix.join(", ")), static_cast<long long>(total.written.size()),
         static_cast<long long>(vaults[0].size()), static_cast<long long>(vaults[1].size()),
         static_cast<long long>(total.replays.size()), static_cast<long long>(synchronised),
         double(peakKb) / 1024.0, double(settledKb) / 1024.0, double(endKb) / 1024.0);

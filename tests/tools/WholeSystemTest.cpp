@@ -46,7 +46,7 @@ protected:
                                  m_storedLocations.insert(location);
                              }
                          });
-        m_host = std::make_unique<PluginHost>(m_dir.filePath(QStringLiteral("data")));
+        m_host = std::make_unique<PluginHost>(m_dir.filePath("data"));
         m_host->setNovirTunnelClient(&m_site.server());
         ASSERT_TRUE(m_host->load(QStringLiteral(PLUGIN_MODULE_PATH), &error)) << qPrintable(error);
     }
@@ -57,7 +57,7 @@ protected:
         QDir::setCurrent(m_previous);
     }
 
-    QString storageDir() const { return m_dir.filePath(QStringLiteral("data/Server")); }
+    QString storageDir() const { return m_dir.filePath("data/Server"); }
 
     const QString m_previous = QDir::currentPath();
     QTemporaryDir m_dir;
@@ -106,7 +106,7 @@ TEST_F(WholeSystem, EveryLocationIsStoredFoundAndBookmarkedAndUnloadIsClean)
     QSet<QString> protectedCameras;
     for (const NovirCamera& camera : m_site.site().cameras) {
         if (camera.recordCap && !camera.location.isEmpty() && camera.online) {
-            expected.insert(QString(camera.location).remove(QStringLiteral("Loc")).toInt());
+            expected.insert(QString(camera.location).remove("Loc").toInt());
         }
         if (camera.protectCap) {
             protectedCameras.insert(camera.name);
@@ -128,46 +128,42 @@ TEST_F(WholeSystem, EveryLocationIsStoredFoundAndBookmarkedAndUnloadIsClean)
     RequestSenderInfo client;
     int clientId = 0;
     client.senderHandle = &clientId;
-    const QVariantMap window{
-        {QStringLiteral("startTimestamp"), (QDateTime::currentSecsSinceEpoch() - 600) * 1000},
-        {QStringLiteral("endTimestamp"), QDateTime::currentMSecsSinceEpoch()},
-        {QStringLiteral("locIDList"), m_site.recordingLocations()}};
+    const QVariantMap window{{"startTimestamp", (QDateTime::currentSecsSinceEpoch() - 600) * 1000},
+                             {"endTimestamp", QDateTime::currentMSecsSinceEpoch()},
+                             {"locIDList", m_site.recordingLocations()}};
     ReplyRecorder search;
-    m_host->request(QStringLiteral("startSearch"), window, client, search.callback());
+    m_host->request("startSearch", window, client, search.callback());
     ASSERT_TRUE(search.waitFinal());
     const std::vector<QVariant> hits = search.progress();
     ASSERT_FALSE(hits.empty());
     // Every hit names its camera from the directory; the two-channel camera's channels too.
     for (const QVariant& hit : hits) {
-        EXPECT_FALSE(hit.toMap().value(QStringLiteral("nodeID")).toString().isEmpty());
+        EXPECT_FALSE(hit.toMap().value("nodeID").toString().isEmpty());
     }
 
     // A case from a hit, with a bookmark on the recording server.
     const QVariantMap hit = hits.front().toMap();
-    QVariantMap item{{QStringLiteral("caseItemType"), 0}, {QStringLiteral("needBookmark"), true}};
+    QVariantMap item{{"caseItemType", 0}, {"needBookmark", true}};
     for (const char* key : {"nodeID", "locID", "startTimestamp", "endTimestamp", "objImage"}) {
         item.insert(QLatin1String(key), hit.value(QLatin1String(key)));
     }
     ReplyRecorder made;
-    m_host->request(
-        QStringLiteral("addCaseWithItem"),
-        QVariantMap{{QStringLiteral("caseName"), QStringLiteral("e2e")}, {QStringLiteral("caseItem"), item}},
-        client, made.callback());
+    m_host->request("addCaseWithItem", QVariantMap{{"caseName", "e2e"}, {"caseItem", item}}, client,
+                    made.callback());
     ASSERT_TRUE(made.waitFinal());
-    EXPECT_EQ(made.last().code, QStringLiteral("0"));
+    EXPECT_EQ(made.last().code, "0");
     const QHash<QString, QVariantMap> bookmarks = m_host->bookmarkPlugin().bookmarks();
     ASSERT_EQ(bookmarks.size(), 1);
-    EXPECT_EQ(bookmarks.begin()->value(QStringLiteral("CameraID")).toString(),
-              hit.value(QStringLiteral("nodeID")).toString());
+    EXPECT_EQ(bookmarks.begin()->value("CameraID").toString(), hit.value("nodeID").toString());
 
     // A re-identification over every location and a search, and the plug-in unloaded under them:
     // each still gets exactly one final reply.
     ReplyRecorder reId;
     ReplyRecorder again;
     QVariantMap reIdParams = window;
-    reIdParams.insert(QStringLiteral("feature"), hit.value(QStringLiteral("feature")));
-    m_host->request(QStringLiteral("startReIdSearch"), reIdParams, client, reId.callback());
-    m_host->request(QStringLiteral("startSearch"), window, client, again.callback());
+    reIdParams.insert("feature", hit.value("feature"));
+    m_host->request("startReIdSearch", reIdParams, client, reId.callback());
+    m_host->request("startSearch", window, client, again.callback());
     m_host->unload();
     EXPECT_EQ(m_host->plugin(), nullptr);
     EXPECT_EQ(reId.finalCount(), 1);

@@ -13,10 +13,10 @@ JOBS=${DELVIX_JOBS:-2}
 if [ ! -f "$BUILD_DIR/build.ninja" ]; then
   cmake -S "$ROOT" -B "$BUILD_DIR" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo -DDELVIX_BUILD_BENCH=OFF
 fi
-cmake --build "$BUILD_DIR" -j "$JOBS" --target test_Load delvix-host PluginDelvixSrv
+cmake --build "$BUILD_DIR" -j "$JOBS" --target test_Host delvix-host PluginDelvixSrv
 
 export DELVIX_LOAD_CLIENTS=${DELVIX_LOAD_CLIENTS:-32}
 export DELVIX_LOAD_SECONDS=${DELVIX_LOAD_SECONDS:-60}
 export DELVIX_LOAD_OBJECTS=${DELVIX_LOAD_OBJECTS:-100000}
 export DELVIX_LOAD_CAMERAS=${DELVIX_LOAD_CAMERAS:-50}
-exec "$BUILD_DIR/bin/test_Load" --gtest_filter='LoadTest.*'
+exec "$BUILD_DIR/bin/test_Host" --gtest_filter='HostLoad.*'

@@ -1,8 +1,10 @@
 #include "StoreFixture.h"
 
+#include <algorithm>
 #include <charconv>
 #include <cmath>
 #include <cstring>
+#include <numeric>
 #include <random>
 
 namespace storetest {
@@ -12,49 +14,42 @@ std::vector<float> randomUnitVector(uint32_t seed)
     std::mt19937 random(seed);
     std::normal_distribution<float> normal(0.0f, 1.0f);
     std::vector<float> vector(kDim);
-    double norm = 0;
     for (float& value : vector) {
         value = normal(random);
-        norm += double(value) * value;
     }
+    const double norm = std::sqrt(std::inner_product(vector.begin(), vector.end(), vector.begin(), 0.0));
     for (float& value : vector) {
-        value = float(value / std::sqrt(norm));
+        value = float(value / norm);
     }
     return vector;
 }
 
 std::vector<float> noisyCopy(const std::vector<float>& base, float noise, uint32_t seed)
 {
-    const std::vector<float> direction = randomUnitVector(seed);
-    std::vector<float> copy(base.size());
+    std::vector<float> copy = randomUnitVector(seed);
     for (size_t i = 0; i < base.size(); ++i) {
-        copy[i] = base[i] + noise * direction[i];
+        copy[i] = base[i] + noise * copy[i];
     }
     return copy;
 }
 
 float plainCosine(const std::vector<float>& a, const std::vector<float>& b)
 {
-    double dot = 0, na = 0, nb = 0;
-    for (size_t i = 0; i < a.size(); ++i) {
-        dot += double(a[i]) * b[i];
-        na += double(a[i]) * a[i];
-        nb += double(b[i]) * b[i];
-    }
-    return float(std::max(0.0, dot / (std::sqrt(na) * std::sqrt(nb))));
+    const auto dot = [](const std::vector<float>& x, const std::vector<float>& y) {
+        return std::inner_product(x.begin(), x.end(), y.begin(), 0.0);
+    };
+    return float(std::max(0.0, dot(a, b) / std::sqrt(dot(a, a) * dot(b, b))));
 }
 
 std::string jsonArray(const std::vector<float>& values)
 {
     std::string text = "[";
     char buffer[32];
-    for (size_t i = 0; i < values.size(); ++i) {
-        if (i) {
-            text += ',';
-        }
-        text.append(buffer, std::to_chars(buffer, buffer + sizeof buffer, values[i]).ptr);
+    for (float value : values) {
+        text.append(buffer, std::to_chars(buffer, buffer + sizeof buffer, value).ptr) += ',';
     }
-    return text + "]";
+    text.back() = ']';
+    return values.empty() ? "[]" : text;
 }
 
 std::string objectJson(const ObjectSpec& object)
@@ -63,9 +58,11 @@ std::string objectJson(const ObjectSpec& object)
                        "\",\"StartTime\":" + std::to_string(object.start) +
                        ",\"EndTime\":" + std::to_string(object.end) + ",\"Attributes\":" + object.attributes +
                        ",\"Trajectory\":[";
-    for (size_t i = 0; i < object.trajectory.size(); ++i) {
-        text += (i ? ",{\"x\":" : "{\"x\":") + std::to_string(object.trajectory[i].first) +
-                ",\"y\":" + std::to_string(object.trajectory[i].second) + "}";
+    for (const auto& [x, y] : object.trajectory) {
+        text += "{\"x\":" + std::to_string(x) + ",\"y\":" + std::to_string(y) + "},";
+    }
+    if (!object.trajectory.empty()) {
+        text.pop_back();
     }
     text += "],\"Thumbnail\":[{\"image\":\"aW1hZ2U" + std::to_string(object.id) + "\"";
     if (!object.body.empty()) {
@@ -86,13 +83,36 @@ std::string objectJson(const ObjectSpec& object)
 std::string answerJson(const std::vector<ObjectSpec>& objects)
 {
     std::string text = "{\"ObjectMetaInfo\":[";
-    for (size_t i = 0; i < objects.size(); ++i) {
-        if (i) {
-            text += ',';
-        }
-        text += objectJson(objects[i]);
+    for (const ObjectSpec& object : objects) {
+        text += objectJson(object) + ",";
+    }
+    if (!objects.empty()) {
+        text.pop_back();
     }
     return text + "]}";
+}
+
+ObjectSpec numberedObject(uint64_t id, bool withVectors)
+{
+    ObjectSpec made{id, "Human", uint32_t(1000 + id), uint32_t(1005 + id)};
+    made.attributes =
+        R"({"Gender":)" + std::to_string(id % 2) + R"(,"Tag":"object )" + std::to_string(id) + "\"}";
+    if (withVectors) {
+        made.body = randomUnitVector(uint32_t(id));
+        if (id % 3 == 0) {
+            made.face = randomUnitVector(uint32_t(id + 100000));
+        }
+    }
+    return made;
+}
+
+std::vector<ObjectSpec> numberedObjects(uint64_t firstId, size_t count, bool withVectors)
+{
+    std::vector<ObjectSpec> objects;
+    for (uint64_t id = firstId; id < firstId + count; ++id) {
+        objects.push_back(numberedObject(id, withVectors));
+    }
+    return objects;
 }
 
 TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QueryOptions& options, std::vector<uint32_t>* locationsOut)
@@ -140,14 +160,13 @@ std::vector<ResultCopy> searchStore(void* database, const QueryOptions& options,
     std::vector<ResultCopy> results;
     int32_t code = Tamsa_GetObjectMetaInfoFirst(database, &query, &search);
     if (code == TAMSA_OK) {
-        TTAMSA_OBJECTMETAINFO_RESULT record{};
-        record.wSize = sizeof record;
-        while ((code = Tamsa_GetObjectMetaInfoNext(search, &record)) == TAMSA_OK) {
-            results.push_back(
-                {record.qwObjectId, record.dwLocationNumber, record.pszObjectType, record.pszAttributes,
-                 record.dwStartTime, record.dwEndTime,
-                 std::vector<double>(record.pTrajectory, record.pTrajectory + record.dwTrajectoryBytes / 8),
-                 record.pszThumbnails, record.fScore, record.fFaceScore});
+        TTAMSA_OBJECTMETAINFO_RESULT r{};
+        r.wSize = sizeof r;
+        while ((code = Tamsa_GetObjectMetaInfoNext(search, &r)) == TAMSA_OK) {
+            results.push_back({r.qwObjectId, r.dwLocationNumber, r.pszObjectType, r.pszAttributes,
+                               r.dwStartTime, r.dwEndTime,
+                               std::vector<double>(r.pTrajectory, r.pTrajectory + r.dwTrajectoryBytes / 8),
+                               r.pszThumbnails, r.fScore, r.fFaceScore});
         }
         Tamsa_GetObjectMetaInfoClose(search);
     }
@@ -161,10 +180,8 @@ std::vector<ResultCopy> searchStore(void* database, const QueryOptions& options,
 
 Ids idsOf(const std::vector<ResultCopy>& results)
 {
-    Ids ids;
-    for (const ResultCopy& result : results) {
-        ids.push_back(result.id);
-    }
+    Ids ids(results.size());
+    std::transform(results.begin(), results.end(), ids.begin(), [](const ResultCopy& r) { return r.id; });
     return ids;
 }
 

@@ -27,51 +27,43 @@ struct ObjectSpec
 {
     uint64_t id = 1;
     std::string type = "Human";
-    uint32_t start = 1000;
-    uint32_t end = 1010;
+    uint32_t start = 1000, end = 1010;
     std::string attributes = "{}";
     std::vector<std::pair<double, double>> trajectory{};
-    std::vector<float> body{};
-    std::vector<float> face{};
+    std::vector<float> body{}, face{};
     bool faceFiltered = false;
     std::string plateCrop{}; // non-empty: a LicensePlateThumbnail with this PlateNumber
 };
 
 std::string objectJson(const ObjectSpec& object);
 std::string answerJson(const std::vector<ObjectSpec>& objects);
+// Objects firstId.. told apart by their id alone: start time, attributes (Gender, Tag) and, with
+// vectors, a body vector of their own and a face vector on every third.
+ObjectSpec numberedObject(uint64_t id, bool withVectors = true);
+std::vector<ObjectSpec> numberedObjects(uint64_t firstId, size_t count, bool withVectors = true);
 
 struct QueryOptions
 {
-    uint32_t start = 0;
-    uint32_t end = 0xFFFFFFFFu;
+    uint32_t start = 0, end = 0xFFFFFFFFu;
     std::vector<uint32_t> locations{1};
     bool nullLocations = false;
-    std::string type;
-    std::string primary;
-    std::string other;
-    std::string trace;
+    std::string type, primary, other, trace;
     uint32_t duration = 0;
-    bool loitering = false;
-    bool descending = false;
+    bool loitering = false, descending = false;
     int32_t direction = 0;
     bool doNotSort = false;
-    std::string feature;
-    std::string faceFeature;
-    std::string plate;
+    std::string feature, faceFeature, plate;
 };
 
 struct ResultCopy
 {
     uint64_t id = 0;
     uint32_t location = 0;
-    std::string type;
-    std::string attributes;
-    uint32_t start = 0;
-    uint32_t end = 0;
+    std::string type, attributes;
+    uint32_t start = 0, end = 0;
     std::vector<double> trajectory;
     std::string thumbnails;
-    float score = 0;
-    float faceScore = 0;
+    float score = 0, faceScore = 0;
 };
 
 // Builds the record; it points into `options` and `locationsOut`, which must outlive it.

@@ -186,14 +186,6 @@ TEST_F(CaseDatabaseTest, ReadModelsOrderDurationsAndCovers)
     vault.addCaseItem(3, item(0, end));
     EXPECT_EQ(vault.getCaseDuration(3).first, "0");
     EXPECT_EQ(vault.getCaseInfoMap(3).value("endTimestamp"), "2024-03-06 09:15");
-    // The list and the single read agree; text that is not JSON reads as no trajectory.
-    raw("UPDATE CaseItem SET trajectory = 'not json'");
-    for (const QVariant& listed : vault.getCaseItemList(2)) {
-        QVariantMap single = vault.getCaseItemInfoMap(listed.toMap().value("id").toInt());
-        single.insert({{"needBookmark", false}, {"objType", 0}});
-        EXPECT_EQ(single, listed.toMap());
-        EXPECT_EQ(single.value("trajectory"), QVariantList());
-    }
 
     // Covers: up to three type-0 images, or one type-1 and one type-0, in start-time order. Rows
     // are written in reverse start-time order so that the statement's own order shows.

@@ -161,16 +161,11 @@ TEST(PluginDelvixSrvDispatch, RefusalsAnswerOnceAndFinal)
     const std::string failure = "1 1 " + RC_FAILURE.toStdString() + " '' [null]";
     for (const auto& [command, expected] :
          std::vector<std::pair<QString, std::string>>{{"noSuchCommand", unsupported},
-                                                      {"", unsupported},
-                                                      {"StartSearch", unsupported},
                                                       {"GETCASELIST", unsupported},
                                                       {"%s%s%s%n", unsupported},
-                                                      {CMD_ADD_CASE_ITEM, failure},
                                                       {CMD_ADD_CASE_WITH_RECORDINGS, failure},
-                                                      {CMD_UPDATE_CASE, failure},
                                                       {CMD_DELETE_CASE, failure},
-                                                      {CMD_GET_CASE_LIST, failure},
-                                                      {CMD_RETRIEVE_CASE_MODEL, failure}}) {
+                                                      {CMD_GET_CASE_LIST, failure}}) {
         ReplyRecorder recorder;
         plugin.Request(command, QVariantMap{{QStringLiteral("a"), 1}}, RequestSenderInfo{},
                        recorder.callback());

@@ -1,6 +1,5 @@
-// The plug-in object: request dispatch, its lifecycle around the case vault, and the case commands,
-// add batches and bookmarks against the host's real bookmark plug-ins (own threads), relay and
-// server-information plug-in, with case vaults in temporary folders.
+// The plug-in object: dispatch, its case vault's lifecycle, the case commands, add batches and
+// bookmarks against the host's real bookmark plug-ins, relay and server-information plug-in.
 
 #include "PluginDelvixSrv.h"
 #include "BookmarkPlugin.h"
@@ -15,6 +14,7 @@
 
 #include <QDir>
 #include <QFileInfo>
+#include <QJsonDocument>
 #include <QTemporaryDir>
 #include <gtest/gtest.h>
 #include <memory>
@@ -53,15 +53,20 @@ private:
     QSet<int> m_failing;
 };
 
-QVariantMap item(const QString& nodeId, bool needBookmark, qint64 start = 1700000000000)
+QVariantMap item(const QString& nodeId, bool needBookmark, qint64 start = 1700000000000,
+                 const QString& bookmark = {})
 {
-    return {{KEY_NODE_ID, nodeId},
-            {KEY_LOC_ID, QStringLiteral("Loc3")},
-            {KEY_START_TIMESTAMP, start},
-            {KEY_END_TIMESTAMP, start + 60000},
-            {KEY_CASE_ITEM_TYPE, 0},
-            {KEY_OBJ_IMAGE, QStringLiteral("aW1n")},
-            {KEY_NEED_BOOKMARK, needBookmark}};
+    QVariantMap map{{KEY_NODE_ID, nodeId},
+                    {KEY_LOC_ID, QStringLiteral("Loc3")},
+                    {KEY_START_TIMESTAMP, start},
+                    {KEY_END_TIMESTAMP, start + 60000},
+                    {KEY_CASE_ITEM_TYPE, 0},
+                    {KEY_OBJ_IMAGE, QStringLiteral("aW1n")},
+                    {KEY_NEED_BOOKMARK, needBookmark}};
+    if (!bookmark.isNull()) {
+        map.insert(KEY_BOOKMARK_ID, bookmark);
+    }
+    return map;
 }
 
 QVariantMap batch(const QString& name, const QVariantList& items)
@@ -74,15 +79,27 @@ int caseIdOf(const Reply& reply)
     return reply.payload.toMap().value(KEY_CASE_ID).toInt();
 }
 
+// A reply and how many came, as one text: "count final code message payload".
+std::string summary(const ReplyRecorder& recorder)
+{
+    const Reply last = recorder.replies().empty() ? Reply{} : recorder.last();
+    return QStringLiteral("%1 %2 %3 '%4' %5")
+        .arg(recorder.replies().size())
+        .arg(last.final)
+        .arg(last.code, last.message,
+             QString::fromUtf8(
+                 QJsonDocument::fromVariant(QVariantList{last.payload}).toJson(QJsonDocument::Compact)))
+        .toStdString();
+}
+
 class PluginCasesTest : public ::testing::Test
 {
 protected:
     void SetUp() override
     {
-        ASSERT_TRUE(m_dir.isValid());
         // The server's database folders exist; the vault makes only its own folder inside.
         for (const char* folder : {"db", "db2", "db3"}) {
-            QDir(m_dir.path()).mkpath(QLatin1String(folder));
+            ASSERT_TRUE(QDir(m_dir.path()).mkpath(QLatin1String(folder)));
         }
         m_serverInfo = std::make_unique<PluginServerInfo>(path("db"));
         m_bookmarks = std::make_unique<BookmarkPlugin>(m_dir.filePath(QStringLiteral("bookmarks.json")));
@@ -109,9 +126,7 @@ protected:
     }
     Reply call(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
     {
-        ReplyRecorder& recorder = send(command, params, plugin);
-        EXPECT_EQ(recorder.finalCount(), 1) << qPrintable(command);
-        return recorder.last();
+        return send(command, params, plugin).last();
     }
     QStringList caseNames(PluginDelvixSrv* plugin = nullptr)
     {
@@ -142,30 +157,23 @@ TEST(PluginDelvixSrvDispatch, RefusalsAnswerOnceAndFinal)
 {
     PluginDelvixSrv plugin;
     // Outside text is never a format; a case command before AllPluginLoaded has no vault.
-    QMap<QString, QString> refusals;
-    for (const char* command :
-         {"noSuchCommand", "", "StartSearch", "GETCASELIST", "startSearch ", "%s%s%s%n"}) {
-        refusals.insert(QString::fromLatin1(command), RC_COMMAND_NOT_SUPPORTED);
-    }
-    for (const QString& command :
-         {CMD_ADD_CASE_WITH_ITEM, CMD_ADD_CASE_ITEM, CMD_ADD_CASE_WITH_RECORDINGS,
-          CMD_ADD_CASE_ITEM_FROM_RECORDINGS, CMD_UPDATE_CASE, CMD_DELETE_CASE, CMD_GET_CASE_LIST,
-          CMD_RETRIEVE_CASE_MODEL, CMD_RETRIEVE_CASE_ITEM_MODEL}) {
-        refusals.insert(command, RC_FAILURE);
-    }
-    for (const auto& [command, code] : refusals.asKeyValueRange()) {
+    const std::string unsupported = "1 1 " + RC_COMMAND_NOT_SUPPORTED.toStdString() + " '' [null]";
+    const std::string failure = "1 1 " + RC_FAILURE.toStdString() + " '' [null]";
+    for (const auto& [command, expected] :
+         std::vector<std::pair<QString, std::string>>{{"noSuchCommand", unsupported},
+                                                      {"GETCASELIST", unsupported},
+                                                      {"%s%s%s%n", unsupported},
+                                                      {CMD_ADD_CASE_WITH_RECORDINGS, failure},
+                                                      {CMD_DELETE_CASE, failure},
+                                                      {CMD_GET_CASE_LIST, failure}}) {
         ReplyRecorder recorder;
         plugin.Request(command, QVariantMap{{QStringLiteral("a"), 1}}, RequestSenderInfo{},
                        recorder.callback());
-        ASSERT_EQ(recorder.replies().size(), 1u) << qPrintable(command);
-        EXPECT_TRUE(recorder.last().final);
-        EXPECT_EQ(recorder.last().code, code) << qPrintable(command);
-        EXPECT_TRUE(recorder.last().message.isEmpty());
-        EXPECT_FALSE(recorder.last().payload.isValid());
+        EXPECT_EQ(summary(recorder), expected) << qPrintable(command);
     }
 }
 
-TEST_F(PluginCasesTest, VaultFollowsTheServerPathUnlessOneWasInstalled)
+TEST_F(PluginCasesTest, VaultFollowsTheServerPath)
 {
     ASSERT_EQ(call(CMD_ADD_CASE_WITH_ITEM,
                    QVariantMap{{KEY_CASE_NAME, "in db"}, {KEY_CASE_ITEM, item("c1", false)}})
@@ -178,90 +186,51 @@ TEST_F(PluginCasesTest, VaultFollowsTheServerPathUnlessOneWasInstalled)
     EXPECT_EQ(caseNames(), QStringList{"in db3"});
     EXPECT_EQ(vault("db").getAllCase().value(0).toMap().value(KEY_CASE_NAME), "in db");
 
-    // A vault installed before AllPluginLoaded stays.
-    m_serverInfo->setServerDatabasePath(path("db"));
-    PluginDelvixSrv installed;
-    installed.setCaseDatabase(std::make_shared<CaseDatabase>(path("db3")));
-    installed.InitialPluginBase(&m_tools);
-    installed.AllPluginLoaded();
-    EXPECT_EQ(caseNames(&installed), QStringList{"in db3"});
-
-    // Without the server-information plug-in there is no path: no file anywhere, and failures.
-    const bool rootFolderBefore = QFileInfo::exists(QStringLiteral("/PluginDelvix"));
+    // Without the server-information plug-in there is no path, and case commands fail.
     HostPluginManager empty;
     TestTools tools(&empty);
     PluginDelvixSrv pathless;
     pathless.InitialPluginBase(&tools);
     pathless.AllPluginLoaded();
     EXPECT_EQ(call(CMD_ADD_CASE_WITH_ITEM, batch("x", {}), &pathless).code, RC_FAILURE);
-    EXPECT_EQ(QFileInfo::exists(QStringLiteral("/PluginDelvix")), rootFolderBefore);
-
-    // Settings reached by name: without "enable" searches are off and answered at once.
-    ASSERT_TRUE(QMetaObject::invokeMethod(&pathless, "setEnableDelvix", Qt::DirectConnection,
-                                          Q_ARG(QVariantMap, QVariantMap{})));
-    ReplyRecorder& search = send(CMD_START_SEARCH, QVariantMap{}, &pathless);
-    ASSERT_EQ(search.replies().size(), 1u);
-    EXPECT_EQ(search.last().code, RC_SUCCESS);
-    EXPECT_FALSE(search.last().payload.isValid());
 }
 
 TEST_F(PluginCasesTest, BookmarksGoWhereTheNodeLives)
 {
-    for (const auto& [node, relay, camera] :
-         std::vector<std::tuple<QString, QString, QString>>{{"cam1", "", "cam1"},
-                                                            {"east/cam1", "east", "cam1"},
-                                                            {"a/b/c", "a", "b"},
-                                                            {"/cam", "", "cam"},
-                                                            {"east/", "east", ""}}) {
-        EXPECT_EQ(PluginDelvixSrv::getRelayPath(node), relay) << qPrintable(node);
-        EXPECT_EQ(PluginDelvixSrv::getCameraId(node), camera) << qPrintable(node);
+    QStringList split;
+    for (const char* node : {"cam1", "east/cam1", "a/b/c", "/cam", "east/"}) {
+        split << PluginDelvixSrv::getRelayPath(node) + '|' + PluginDelvixSrv::getCameraId(node);
     }
+    EXPECT_EQ(split.join(' '), "|cam1 east|cam1 a|b |cam east|");
 
     // Remote answers are mapped; an unknown relay path is refused at once.
     const QVariantMap request{{KEY_BM_CAMERA_ID, QStringLiteral("cam7")}};
     ReplyRecorder ok, failed, unknown, local;
     m_plugin->addSubstationBookmark(request, QStringLiteral("east"), ok.callback());
     ASSERT_TRUE(ok.waitFinal());
-    EXPECT_EQ(ok.last().code, RC_SUCCESS);
     const QString remoteId = ok.last().payload.toMap().value(KEY_BM_BOOKMARK_ID).toString();
+    EXPECT_EQ(ok.last().code, RC_SUCCESS);
     EXPECT_TRUE(m_remoteBookmarks->bookmarks().contains(remoteId));
     m_remoteBookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Fail);
     m_plugin->addSubstationBookmark(request, QStringLiteral("east"), failed.callback());
-    ASSERT_TRUE(failed.waitFinal());
-    EXPECT_EQ(failed.last().code, RC_FAILURE);
-    EXPECT_FALSE(failed.last().payload.isValid());
-    m_remoteBookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Normal);
     m_plugin->addSubstationBookmark(request, QStringLiteral("west"), unknown.callback());
-    ASSERT_EQ(unknown.replies().size(), 1u);
-    EXPECT_EQ(unknown.last().code, RC_FAILURE);
+    EXPECT_EQ(summary(unknown), "1 1 " + RC_FAILURE.toStdString() + " '' [null]");
+    ASSERT_TRUE(failed.waitFinal());
+    EXPECT_EQ(summary(failed), summary(unknown));
+    m_remoteBookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Normal);
 
     // Deleted items take their bookmarks along, each where it lives.
     m_plugin->addBookmark(QVariantMap{{KEY_BM_CAMERA_ID, QStringLiteral("c1")}}, m_sender, local.callback());
     ASSERT_TRUE(local.waitFinal());
     const QString localId = local.last().payload.toMap().value(KEY_BM_BOOKMARK_ID).toString();
     const int requestsBefore = m_bookmarks->requestCount();
-    QVariantMap emptyBookmark = item(QStringLiteral("c3"), false);
-    emptyBookmark.insert(KEY_BOOKMARK_ID, QString());
-    QVariantMap localItem = item(QStringLiteral("c1"), false);
-    localItem.insert(KEY_BOOKMARK_ID, localId);
-    QVariantMap remoteItem = item(QStringLiteral("east/c2"), false);
-    remoteItem.insert(KEY_BOOKMARK_ID, remoteId);
-    m_plugin->handleDeleteCaseItemBookmark(
-        {item(QStringLiteral("c3"), false), emptyBookmark, localItem, remoteItem}, m_sender);
+    m_plugin->handleDeleteCaseItemBookmark({item("c3", false), item("c3", false, 1, ""),
+                                            item("c1", false, 1, localId),
+                                            item("east/c2", false, 1, remoteId)},
+                                           m_sender);
     ASSERT_TRUE(waitFor(
         [&] { return m_bookmarks->bookmarks().isEmpty() && m_remoteBookmarks->bookmarks().isEmpty(); }));
     EXPECT_EQ(m_bookmarks->requestCount(), requestsBefore + 1);
-
-    // Without a bookmark plug-in, adding answers failure once.
-    HostPluginManager none;
-    TestTools tools(&none, nullptr, &m_relay);
-    PluginDelvixSrv bare;
-    bare.InitialPluginBase(&tools);
-    ReplyRecorder added;
-    bare.addBookmark(request, m_sender, added.callback());
-    ASSERT_EQ(added.replies().size(), 1u);
-    EXPECT_TRUE(added.last().final);
-    EXPECT_EQ(added.last().code, RC_FAILURE);
 }
 
 TEST_F(PluginCasesTest, AddBatchesStoreWhatWasBookmarked)
@@ -269,155 +238,122 @@ TEST_F(PluginCasesTest, AddBatchesStoreWhatWasBookmarked)
     // Without bookmarks: one progress reply per item, then the case.
     ReplyRecorder& plain = send(CMD_ADD_CASE_WITH_RECORDINGS,
                                 batch("Robbery", {item("c1", false, 1000), item("c2", false, 2000)}));
-    const std::vector<Reply> replies = plain.replies();
-    ASSERT_EQ(replies.size(), 3u);
-    for (int i = 0; i < 2; ++i) {
-        EXPECT_FALSE(replies[i].final);
-        EXPECT_EQ(replies[i].code, RC_SUCCESS);
+    QStringList replies;
+    for (const Reply& reply : plain.replies()) {
+        replies << QString::number(reply.final) + reply.code +
+                       reply.payload.toMap().value(KEY_CASE_NAME).toString();
     }
-    EXPECT_EQ(replies[2].code, RC_SUCCESS);
-    EXPECT_EQ(replies[2].payload.toMap().value(KEY_CASE_NAME), "Robbery");
-    EXPECT_EQ(vault().getCaseItemList(caseIdOf(replies[2])).size(), 2);
+    EXPECT_EQ(replies.join(','), QStringLiteral("0%1,0%1,1%1Robbery").arg(RC_SUCCESS));
+    EXPECT_EQ(vault().getCaseItemList(caseIdOf(plain.last())).size(), 2);
 
     // Bookmarks are made here and through the relay; an item keeps a bookmark id of its own.
-    QVariantMap own = item(QStringLiteral("c1"), true, 1000);
-    own.insert(KEY_BOOKMARK_ID, QStringLiteral("mine"));
-    const Reply marked =
-        call(CMD_ADD_CASE_WITH_RECORDINGS, batch("marked", {own, item("east/c2", true, 2000)}));
+    const Reply marked = call(CMD_ADD_CASE_WITH_RECORDINGS,
+                              batch("marked", {item("c1", true, 1000, "mine"), item("east/c2", true, 2000)}));
     ASSERT_EQ(marked.code, RC_SUCCESS);
-    QStringList stored;
+    QSet<QString> stored;
     for (const QVariant& element : vault().getCaseItemList(caseIdOf(marked))) {
         stored << element.toMap().value(KEY_BOOKMARK_ID).toString();
     }
     EXPECT_EQ(m_bookmarks->bookmarks().size(), 1); // made, though the item kept its own id
     ASSERT_EQ(m_remoteBookmarks->bookmarks().size(), 1);
-    EXPECT_EQ(QSet<QString>(stored.begin(), stored.end()),
-              (QSet<QString>{"mine", m_remoteBookmarks->bookmarks().keys().first()}));
+    EXPECT_EQ(stored, (QSet<QString>{"mine", m_remoteBookmarks->bookmarks().keys().first()}));
     const QVariantMap made = m_remoteBookmarks->bookmarks().values().first();
-    EXPECT_EQ(made.value(KEY_BM_CAMERA_ID), "c2");
-    EXPECT_EQ(made.value(KEY_BM_CREATOR), "admin");
-    EXPECT_EQ(made.value(KEY_BM_GROUP), "CaseVault");
-    EXPECT_EQ(made.value(KEY_BM_LOCATION_ID), "Loc3");
+    EXPECT_EQ(QStringList({made.value(KEY_BM_CAMERA_ID).toString(), made.value(KEY_BM_CREATOR).toString(),
+                           made.value(KEY_BM_GROUP).toString(), made.value(KEY_BM_LOCATION_ID).toString()}),
+              QStringList({"c2", "admin", "CaseVault", "Loc3"}));
 
     // A failed bookmark leaves its item out and ends the batch with failure.
     m_bookmarks->setAnswerMode(BookmarkPlugin::AnswerMode::Fail);
     ReplyRecorder& failed = send(CMD_ADD_CASE_WITH_ITEM,
                                  QVariantMap{{KEY_CASE_NAME, "failed"}, {KEY_CASE_ITEM, item("c1", true)}});
-    ASSERT_EQ(failed.replies().size(), 2u);
-    EXPECT_EQ(failed.last().code, RC_FAILURE);
-    EXPECT_FALSE(failed.last().payload.isValid());
-    const QVariantList cases = vault().getAllCase();
-    ASSERT_EQ(cases.size(), 3);
-    EXPECT_TRUE(vault().getCaseItemList(cases[2].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
+    EXPECT_EQ(summary(failed), "2 1 " + RC_FAILURE.toStdString() + " '' [null]");
+    ASSERT_EQ(vault().getAllCase().size(), 3);
+    EXPECT_TRUE(
+        vault().getCaseItemList(vault().getAllCase()[2].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
 }
 
 TEST_F(PluginCasesTest, BatchesAreAnsweredOnceWhateverTheBookmarkPluginDoes)
 {
     HoldingBookmarkPlugin holding;
     m_manager.registerPluginObject(PLUGIN_ID_BOOKMARK, &holding);
+    const QVariantMap bookmark{{KEY_BM_BOOKMARK_ID, QStringLiteral("b1")}};
+    auto answer = [&](int i) { holding.callbacks[i](true, RC_SUCCESS, QString(), bookmark); };
     // An empty batch asks nothing and answers nothing; its case stays.
-    ReplyRecorder empty;
+    ReplyRecorder empty, twice, waiting;
     m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("kept", {}), m_sender, empty.callback());
     EXPECT_EQ(caseNames(), QStringList{"kept"}); // a later request's answer came first
     EXPECT_TRUE(empty.replies().empty());
 
     // Double answers count once.
-    ReplyRecorder twice;
     m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("twice", {item("c1", true), item("c2", true)}),
                       m_sender, twice.callback());
     ASSERT_EQ(holding.callbacks.size(), 2);
-    const QVariantMap bookmark{{KEY_BM_BOOKMARK_ID, QStringLiteral("b1")}};
-    holding.callbacks[0](true, RC_SUCCESS, QString(), bookmark);
-    holding.callbacks[0](true, RC_SUCCESS, QString(), bookmark);
+    answer(0);
+    answer(0);
     EXPECT_EQ(twice.replies().size(), 1u);
-    holding.callbacks[1](true, RC_SUCCESS, QString(), bookmark);
+    answer(1);
     ASSERT_TRUE(twice.waitFinal());
-    holding.callbacks[1](true, RC_SUCCESS, QString(), bookmark);
+    answer(1);
     QCoreApplication::processEvents();
     EXPECT_EQ(twice.replies().size(), 3u);
-    EXPECT_EQ(twice.last().code, RC_SUCCESS);
     EXPECT_EQ(vault().getCaseItemList(caseIdOf(twice.last())).size(), 2);
 
     // The plug-in goes while a batch waits: the client gets its final answer then, and a late
     // bookmark answer neither replies again nor writes anything.
-    ReplyRecorder waiting;
     m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("waiting", {item("c1", true), item("c2", true)}),
                       m_sender, waiting.callback());
     ASSERT_EQ(holding.callbacks.size(), 4);
-    holding.callbacks[2](true, RC_SUCCESS, QString(), bookmark);
-    ASSERT_EQ(waiting.replies().size(), 1u);
+    answer(2);
     m_plugin.reset();
-    ASSERT_EQ(waiting.finalCount(), 1);
-    EXPECT_EQ(waiting.last().code, RC_FAILURE);
-    holding.callbacks[3](true, RC_SUCCESS, QString(), bookmark);
+    answer(3);
     QCoreApplication::processEvents();
-    EXPECT_EQ(waiting.replies().size(), 2u);
-    const QVariantList cases = vault().getAllCase();
-    ASSERT_EQ(cases.size(), 3);
-    EXPECT_TRUE(vault().getCaseItemList(cases[2].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
+    EXPECT_EQ(summary(waiting), "2 1 " + RC_FAILURE.toStdString() + " '' [null]");
+    ASSERT_EQ(vault().getAllCase().size(), 3);
+    EXPECT_TRUE(
+        vault().getCaseItemList(vault().getAllCase()[2].toMap().value(KEY_CASE_ID).toInt()).isEmpty());
 }
 
-TEST_F(PluginCasesTest, CaseCommandsGuardTheDataAndReadModelsShowIt)
+TEST_F(PluginCasesTest, CaseCommandsGuardTheData)
 {
     m_plugin->setCaseDatabase(std::make_shared<CaseDatabase>()); // a case that cannot be created
-    EXPECT_EQ(send(CMD_ADD_CASE_WITH_ITEM, QVariantMap{{KEY_CASE_ITEM, item("c", false)}}).replies().size(),
-              1u);
-    EXPECT_EQ(m_recorders.back()->last().code, RC_FAILURE);
-
-    auto failing = std::make_shared<FailingUpdateDatabase>(path("db"), QSet<int>{});
-    m_plugin->setCaseDatabase(failing);
+    EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, QVariantMap{{KEY_CASE_ITEM, item("c", false)}})),
+              "1 1 " + RC_FAILURE.toStdString() + " '' [null]");
+    m_plugin->setCaseDatabase(std::make_shared<CaseDatabase>(path("db")));
     const int caseId = caseIdOf(
         call(CMD_ADD_CASE_WITH_RECORDINGS,
              batch("c", {item("c1", false, 1000), item("c2", false, 2000), item("c3", false, 3000)})));
-    QList<int> ids = failing->getCaseItemIdSet(caseId).values();
+    QList<int> ids = vault().getCaseItemIdSet(caseId).values();
     std::sort(ids.begin(), ids.end());
     ASSERT_EQ(ids.size(), 3);
-
-    const QVariantList model = call(CMD_RETRIEVE_CASE_MODEL, QVariant()).payload.toList();
-    ASSERT_EQ(model.size(), 1);
-    EXPECT_EQ(model[0].toMap().value(KEY_CASE_ID), caseId);
-    EXPECT_EQ(model[0].toMap().value(KEY_START_TIMESTAMP).toString().size(), 16); // "yyyy-MM-dd hh:mm"
-    EXPECT_EQ(model[0].toMap().value(KEY_COVER_IMAGE).toStringList(), (QStringList{"aW1n", "aW1n", "aW1n"}));
-    const QVariantMap itemModel = call(CMD_RETRIEVE_CASE_ITEM_MODEL, caseId).payload.toMap();
-    EXPECT_EQ(itemModel.value(KEY_CASE_INFO_MAP).toMap().value(KEY_CASE_ID), caseId);
-    EXPECT_EQ(itemModel.value(KEY_CASE_ITEM_LIST).toList().size(), 3);
-
     EXPECT_EQ(call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, 9999}}).code, RC_CASE_NOT_FOUND);
-    const Reply missing = call(CMD_DELETE_CASE, 9999);
-    EXPECT_EQ(missing.code, RC_CASE_NOT_FOUND);
-    EXPECT_FALSE(missing.payload.isValid());
-    EXPECT_EQ(call(CMD_DELETE_CASE, QStringLiteral("not a number")).code, RC_CASE_NOT_FOUND);
+    EXPECT_EQ(summary(send(CMD_DELETE_CASE, 9999)), "1 1 " + RC_CASE_NOT_FOUND.toStdString() + " '' [null]");
 
-    // One failing item update: "-2", and that item goes with the one not listed.
+    // One failing item update: partial failure, and that item goes with the one not listed.
     auto failingOne = std::make_shared<FailingUpdateDatabase>(path("db"), QSet<int>{ids[1]});
     m_plugin->setCaseDatabase(failingOne);
     QVariantMap keep = item("c1", false, 1000);
-    keep.insert(KEY_ID, ids[0]);
-    keep.insert(KEY_COMMENT, QStringLiteral("kept"));
+    keep.insert({{KEY_ID, ids[0]}, {KEY_COMMENT, QStringLiteral("kept")}});
     QVariantMap fail = item("c2", false, 2000);
     fail.insert(KEY_ID, ids[1]);
     const Reply updated = call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, caseId},
                                                             {KEY_CASE_NAME, QStringLiteral("renamed")},
                                                             {KEY_CASE_ITEM, QVariantList{keep, fail}}});
-    EXPECT_EQ(updated.code, RC_PARTIAL_FAILURE);
-    EXPECT_EQ(updated.payload.toMap().value(KEY_CASE_NAME), "renamed");
+    EXPECT_EQ(updated.code + updated.payload.toMap().value(KEY_CASE_NAME).toString(),
+              RC_PARTIAL_FAILURE + "renamed");
     EXPECT_EQ(failingOne->getCaseItemIdSet(caseId), QSet<int>{ids[0]});
     EXPECT_EQ(failingOne->getCaseItemInfoMap(ids[0]).value(KEY_COMMENT), "kept");
 
     // An empty item list empties the case and still succeeds.
     EXPECT_EQ(call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, caseId}}).code, RC_SUCCESS);
     EXPECT_TRUE(vault().getCaseItemIdSet(caseId).isEmpty());
-    const Reply deleted = call(CMD_DELETE_CASE, caseId);
-    EXPECT_EQ(deleted.code, RC_SUCCESS);
-    EXPECT_EQ(deleted.payload.toInt(), caseId);
-    EXPECT_TRUE(caseNames().isEmpty());
-    EXPECT_TRUE(vault().getAllCase().isEmpty());
+    EXPECT_EQ(summary(send(CMD_DELETE_CASE, caseId)),
+              "1 1 " + RC_SUCCESS.toStdString() + " '' [" + std::to_string(caseId) + "]");
+    EXPECT_TRUE(caseNames().isEmpty() && vault().getAllCase().isEmpty());
 }
 
 TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
 {
-    constexpr int kThreads = 4;
-    constexpr int kCasesPerThread = 15;
+    constexpr int kThreads = 4, kCasesPerThread = 15;
     std::vector<ReplyRecorder> recorders(kThreads * kCasesPerThread);
     std::vector<std::thread> threads;
     for (int t = 0; t < kThreads; ++t) {
@@ -444,8 +380,8 @@ TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
                            [](const ReplyRecorder& r) { return r.finalCount(); });
     }));
     for (ReplyRecorder& recorder : recorders) {
-        EXPECT_EQ(recorder.finalCount(), 1);
-        EXPECT_EQ(recorder.last().code, RC_SUCCESS);
+        EXPECT_EQ(QStringLiteral("%1 %2").arg(recorder.finalCount()).arg(recorder.last().code),
+                  "1 " + RC_SUCCESS);
     }
     int stored = 0;
     for (const char* folder : {"db", "db2"}) {
@@ -493,9 +429,7 @@ TEST_F(PluginCasesTest, DISABLED_FullVaultFolderInThisProcess)
         FileSizeLimit full(QFileInfo(path("db") + QStringLiteral("/PluginDelvix/CaseVault.db")).size());
         for (int round = 0; round < 40; ++round) {
             refused += (add(0) ? 0 : 1) + (add(firstCase) ? 0 : 1);
-            const Reply list = call(CMD_GET_CASE_LIST, QVariant()); // reads keep answering
-            EXPECT_EQ(list.code, RC_SUCCESS);
-            EXPECT_GE(list.payload.toList().size(), 3);
+            EXPECT_GE(call(CMD_GET_CASE_LIST, QVariant()).payload.toList().size(), 3); // reads keep answering
         }
         EXPECT_EQ(call(CMD_RETRIEVE_CASE_ITEM_MODEL, firstCase).code, RC_SUCCESS);
     }
@@ -517,9 +451,7 @@ TEST_F(PluginCasesTest, DISABLED_FullVaultFolderInThisProcess)
     for (int caseId : acknowledgedCases) {
         EXPECT_TRUE(reopened.containCase(caseId)) << caseId;
     }
-    for (qint64 start : acknowledgedItems) {
-        EXPECT_TRUE(storedStarts.contains(start)) << "the item starting " << start << " is missing";
-    }
+    EXPECT_EQ(acknowledgedItems - storedStarts, QSet<qint64>()) << "acknowledged items are missing";
 }
 
 #include "PluginDelvixSrvTest.moc"

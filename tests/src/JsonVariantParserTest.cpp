@@ -1,11 +1,8 @@
 // The fast reader of the store's texts takes the common texts itself, to the tree QJsonDocument
-// gives, rather than leave them to the slow route, and refuses what QJsonDocument refuses. (The
-// record-conversion corpus replay checks agreement on whatever it accepts.)
+// gives, and refuses what QJsonDocument refuses.
 #include "JsonVariantParser.h"
 
-#include <QJsonArray>
 #include <QJsonDocument>
-#include <QJsonObject>
 
 #include <gtest/gtest.h>
 
@@ -13,20 +10,17 @@
 
 TEST(JsonVariantParserTest, ReadsTheCommonTextsItself)
 {
-    const QList<QByteArray> texts = {
-        R"({"Thumbnail":[{"image":"QUJD+/=","feature":[0.25,-1,1e-3]}],"k":{"a":[]}})",
-        R"(["a", "b\n\"\u00e9", {"x": [1, "y", null, true, false]}, [] ])",
-        "[\"\xc3\xa9\xe6\x97\xa5\", \"12345678\xc3\xa9\", \"\", \"1234567\", \"12345678\"]",
-        "[1, -0.5, 1.5e1, 2E-2, 123456789012345678, 1234567890123456789, 9007199254740993.0]",
-        "[12345678901234567890123, 1e300, 0.1234567890123456789, -1.0000000000000000000001]"};
-    for (const QByteArray& text : texts) {
+    for (const QByteArray text :
+         {R"({"Thumbnail":[{"image":"QUJD+/=","feature":[0.25,-1,1e-3]}],"k":{"a":[]}})",
+          R"(["a", "b\n\"\u00e9", {"x": [1, "y", null, true, false]}, [] ])",
+          "[\"\xc3\xa9\xe6\x97\xa5\", \"12345678\xc3\xa9\", \"\", \"1234567\", \"12345678\"]",
+          "[1, -0.5, 1.5e1, 2E-2, 123456789012345678, 1234567890123456789, 9007199254740993.0]",
+          "[12345678901234567890123, 1e300, 0.1234567890123456789, -1.0000000000000000000001]"}) {
         bool ok = false;
-        const QVariant fast = JsonVariantParser::parse(text.constData(), std::size_t(text.size()), &ok);
-        EXPECT_TRUE(ok) << text.constData();
-        const QJsonDocument document = QJsonDocument::fromJson(text);
-        EXPECT_EQ(fast, document.isObject() ? QVariant(document.object().toVariantMap())
-                                            : QVariant(document.array().toVariantList()))
+        EXPECT_EQ(JsonVariantParser::parse(text.constData(), std::size_t(text.size()), &ok),
+                  QJsonDocument::fromJson(text).toVariant())
             << text.constData();
+        EXPECT_TRUE(ok) << text.constData();
     }
     for (const char* refused : {"[1.]", "[1e]", "[01]", "{\"a\":1", "[1,]", "[\"open"}) {
         bool ok = true;

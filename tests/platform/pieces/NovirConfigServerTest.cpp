@@ -127,8 +127,7 @@ TEST(NovirServer, AnswersComeInPartsFromTheServerThreadAndADownServerTakesNoRequ
         names += valuesAt(nodeTexts[i], u"NodeInfo/Cameras/Cam/Name"_s) +
                  valuesAt(locationTexts[i], u"LocRecs/LocList/Loc/Alias"_s);
     }
-    names.sort();
-    expected.sort();
+    names.sort(), expected.sort();
     EXPECT_EQ(names, expected);
     const auto lobby =
         ask(u"GetNodeInfo"_s, u"<GetNodeInfo><Node>Lobby</Node></GetNodeInfo>"_s, ConfigServer);

@@ -1,12 +1,10 @@
-// The in-process host and the delvix-host program: the plug-in module loads and foreign ones are
-// refused, requests run on request threads, the plug-in manager connects plug-in signals, and the
-// relay reaches the remote servers named in host.json.
+// The in-process host: the plug-in module loads and foreign ones are refused, requests run on request
+// threads, the plug-in manager connects plug-in signals, and the relay reaches the servers in host.json.
 #include "PluginHost.h"
 #include "TestWait.h"
 
 #include <QDir>
 #include <QMutex>
-#include <QProcess>
 #include <QSet>
 #include <QSettings>
 #include <QTemporaryDir>
@@ -88,7 +86,6 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
     EXPECT_EQ(manager->GetPluginObject(u"no-such-plugin"_s), nullptr);
     EXPECT_TRUE(manager->ConnectPluginSignal(serverInfo, signal, &receiver, slot, 0));
     EXPECT_FALSE(manager->ConnectPluginSignal(u"no-such-plugin"_s, signal, &receiver, slot, 0));
-    EXPECT_FALSE(manager->ConnectPluginSignal(serverInfo, "2noSuchSignal()", &receiver, slot, 0));
     host.serverInfo().setServerDatabasePath(u"/elsewhere"_s);
     host.serverInfo().setServerDatabasePath(u"/elsewhere"_s); // unchanged: no signal
     EXPECT_EQ(receiver.paths, QStringList{u"/elsewhere"_s});
@@ -107,39 +104,6 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
     EXPECT_EQ(stored, 1);
     EXPECT_EQ(host.remoteBookmarkPlugin(u"east"_s)->bookmarks().size(), 1);
     EXPECT_TRUE(host.bookmarkPlugin().bookmarks().isEmpty());
-}
-
-TEST(DelvixHostProgram, CallPrintsOneJsonLinePerReplyAndRefusesBadUse)
-{
-    QTemporaryDir data;
-    const QStringList call{u"call"_s, u"--data"_s, data.path()};
-    const QByteArray unsupported =
-        R"({"final":true,"code":"commandNotSupportError","message":"","payload":null})"
-        "\n";
-    const struct
-    {
-        QStringList args;
-        QByteArray out; // empty: the program fails
-        const char* err;
-    } rows[] = {
-        {call + QStringList{u"noSuchCommand"_s}, unsupported, ""},
-        {call + QStringList{u"Nope"_s, u"5"_s}, unsupported, ""}, // a bare number is a parameter
-        {call, {}, "usage"},
-        {call + QStringList{u"x"_s, u"{not json"_s}, {}, ""},
-        {call + QStringList{u"--module"_s, WRONG_ID_MODULE_PATH, u"x"_s}, {}, "PluginID"},
-        {{u"frobnicate"_s}, {}, ""},
-        {{u"call"_s, u"--bogus"_s, u"x"_s}, {}, ""},
-    };
-    for (const auto& row : rows) {
-        QProcess process;
-        process.start(DELVIX_HOST_PATH, row.args);
-        ASSERT_TRUE(process.waitForFinished(scaledMs(30000)));
-        const QByteArray err = process.readAllStandardError();
-        EXPECT_EQ(process.exitStatus() == QProcess::NormalExit && process.exitCode() == 0, !row.out.isEmpty())
-            << err.constData();
-        EXPECT_EQ(process.readAllStandardOutput(), row.out);
-        EXPECT_TRUE(err.contains(row.err)) << qPrintable(row.args.join(u' ')) << err.constData();
-    }
 }
 
 #include "PluginHostTest.moc"

@@ -15,21 +15,12 @@ public:
     using ServerType = NSNovirTunnelClient::ServerType;
     struct Request
     {
-        QString pluginId;
         void* clientID = nullptr;
         ServerType type = NSNovirTunnelClient::ConfigServer;
         QString cmdName;
         NSNovirTunnelClient::RequestInfo info;
-        bool subscribe = false;
         QString serverId;
         NSNovirTunnelClient::EventHandler eventHandler;
-    };
-    struct Registration
-    {
-        QString pluginId;
-        ServerType type;
-        QString name;
-        NSNovirTunnelClient::BroadcastHandler handler;
     };
 
     // The hastiest client possible: servers already up are reported from inside the
@@ -38,25 +29,18 @@ public:
     std::function<void(int requestIndex)> onInsert;
     QString serverId = QStringLiteral("srv-1");
     QList<Request> requests;
-    QList<Registration> broadcastRegistrations;
-    QStringList connectRegistrations; // plug-in ids
+    QList<QPair<QString, NSNovirTunnelClient::BroadcastHandler>> broadcastHandlers;
     QList<NSNovirTunnelClient::ConnectStatusHandler> connectHandlers;
     char account = 0;
     char servers[2] = {};
 
-    Qt::HANDLE handleOf(ServerType type)
-    {
-        return &servers[type == NSNovirTunnelClient::LocationServer ? 1 : 0];
-    }
-
-    // ---- test verbs ----
+    Qt::HANDLE handleOf(ServerType type) { return &servers[type == NSNovirTunnelClient::LocationServer]; }
     void connectServer(ServerType type, bool connected = true)
     {
         for (const auto& handler : QList(connectHandlers)) {
             handler(handleOf(type), type, connected);
         }
     }
-    // Answers the request at index with one part.
     void answer(int index, bool success, const QString& retCode, const QString& text, bool finish = true)
     {
         const Request request = requests.at(index);
@@ -65,32 +49,29 @@ public:
     // Index of the last request sent under this command name, -1 when none.
     int lastRequest(const QString& cmdName) const
     {
-        for (int i = requests.size() - 1; i >= 0; --i) {
-            if (requests.at(i).cmdName == cmdName) {
-                return i;
-            }
+        int i = int(requests.size()) - 1;
+        while (i >= 0 && requests.at(i).cmdName != cmdName) {
+            --i;
         }
-        return -1;
+        return i;
     }
     void broadcast(const QString& name, const QString& relayPath, const QString& message)
     {
-        for (const Registration& registration : QList(broadcastRegistrations)) {
-            if (registration.name == name) {
-                registration.handler(handleOf(NSNovirTunnelClient::ConfigServer), name,
-                                     NSNovirTunnelClient::ConfigServer, relayPath, message);
+        for (const auto& [registered, handler] : QList(broadcastHandlers)) {
+            if (registered == name) {
+                handler(handleOf(NSNovirTunnelClient::ConfigServer), name, NSNovirTunnelClient::ConfigServer,
+                        relayPath, message);
             }
         }
     }
     // Sends a status event through the subscription's handler.
     void statusEvent(const QString& sourceId, const QString& relayPath, const QString& message)
     {
-        const Request request = requests.at(lastRequest(QStringLiteral("SubCamStatus")));
-        request.eventHandler(handleOf(NSNovirTunnelClient::ConfigServer), sourceId,
-                             QStringLiteral("CamStatus"), NSNovirTunnelClient::ConfigServer, relayPath,
-                             message);
+        requests.at(lastRequest(QStringLiteral("SubCamStatus")))
+            .eventHandler(handleOf(NSNovirTunnelClient::ConfigServer), sourceId, QStringLiteral("CamStatus"),
+                          NSNovirTunnelClient::ConfigServer, relayPath, message);
     }
 
-    // ---- INovirTunnelClient ----
     void* getServerAccountID() override { return &account; }
     QVariant getServerInfo(Qt::HANDLE clientID, int infoKind) override
     {
@@ -98,24 +79,22 @@ public:
                                                                                         : QVariant();
     }
     bool isServerConnected(ServerType) override { return true; }
-    bool insertRequest(const QString& pluginId, void* clientID, ServerType type, const QString& cmdName,
+    bool insertRequest(const QString&, void* clientID, ServerType type, const QString& cmdName,
                        const NSNovirTunnelClient::RequestInfo& request) override
     {
-        return insert(Request{pluginId, clientID, type, cmdName, request, false, QString(), {}});
+        return insert(Request{clientID, type, cmdName, request, QString(), {}});
     }
-    bool insertSubscribeRequest(const QString& pluginId, void* clientID, ServerType type,
-                                const QString& cmdName, const NSNovirTunnelClient::RequestInfo& request,
+    bool insertSubscribeRequest(const QString&, void* clientID, ServerType type, const QString& cmdName,
+                                const NSNovirTunnelClient::RequestInfo& request,
                                 const QString& subscribedServerId,
                                 const NSNovirTunnelClient::EventHandler& eventHandler) override
     {
-        return insert(
-            Request{pluginId, clientID, type, cmdName, request, true, subscribedServerId, eventHandler});
+        return insert(Request{clientID, type, cmdName, request, subscribedServerId, eventHandler});
     }
-    void registerConnectStatusHandler(const QString& pluginId, ServerType,
+    void registerConnectStatusHandler(const QString&, ServerType,
                                       const NSNovirTunnelClient::ConnectStatusHandler& handler,
                                       const QString&) override
     {
-        connectRegistrations.append(pluginId);
         connectHandlers.append(handler);
         if (connectOnRegister) {
             handler(handleOf(NSNovirTunnelClient::ConfigServer), NSNovirTunnelClient::ConfigServer, true);
@@ -125,12 +104,11 @@ public:
     void registerEventHandler(const QString&, void*, ServerType, const QString&,
                               const NSNovirTunnelClient::EventHandler&, const QString&) override
     {}
-    void registerBroadcastHandler(const QString& pluginId, void*, ServerType type,
-                                  const QString& broadcastName,
+    void registerBroadcastHandler(const QString&, void*, ServerType, const QString& broadcastName,
                                   const NSNovirTunnelClient::BroadcastHandler& handler,
                                   const QString&) override
     {
-        broadcastRegistrations.append(Registration{pluginId, type, broadcastName, handler});
+        broadcastHandlers.append({broadcastName, handler});
     }
 
 private:

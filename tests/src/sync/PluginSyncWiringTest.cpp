@@ -13,62 +13,36 @@
 
 #include <thread>
 
-namespace {
-
-QVariantMap record(const QString& name, const QString& location)
+TEST(PluginSyncWiring, DirectoryAndFetchedMetadataReachTheInstalledSynchronizerAndCollector)
 {
-    return QVariantMap{{"Name", name},     {"IP", "127.0.0.1"}, {"Port", 80},           {"User", "u"},
-                       {"Password", "70"}, {"UseSSL", false},   {"Location", location}, {"GroupID", 7}};
-}
-
-class PluginSyncWiringTest : public ::testing::Test
-{
-protected:
-    void SetUp() override
-    {
-        previousDir = QDir::currentPath();
-        QDir::setCurrent(dir.path()); // no settings files
-        auto owned = QSharedPointer<CameraSynchronizer>::create(std::make_shared<CameraProxy>(client));
-        sync = owned.data();
-        plugin.setCameraSynchronizer(owned);
-        plugin.setCameraInformationCollector(QSharedPointer<ICameraInformationCollector>(collector));
-        ASSERT_TRUE(plugin.InitialPluginBase(nullptr));
-    }
-    void TearDown() override { QDir::setCurrent(previousDir); }
-
     QTemporaryDir dir;
-    QString previousDir;
-    std::shared_ptr<RecordingHttpClient> client = std::make_shared<RecordingHttpClient>();
+    const QString previousDir = QDir::currentPath();
+    QDir::setCurrent(dir.path()); // no settings files
+    auto client = std::make_shared<RecordingHttpClient>();
     PluginDelvixSrv plugin;
-    CameraSynchronizer* sync = nullptr;           // owned by the plug-in
-    FakeCollector* collector = new FakeCollector; // owned by the plug-in
-};
+    auto owned = QSharedPointer<CameraSynchronizer>::create(std::make_shared<CameraProxy>(client));
+    CameraSynchronizer* sync = owned.data();
+    auto* collector = new FakeCollector; // owned by the plug-in
+    plugin.setCameraSynchronizer(owned);
+    plugin.setCameraInformationCollector(QSharedPointer<ICameraInformationCollector>(collector));
+    ASSERT_TRUE(plugin.InitialPluginBase(nullptr));
 
-} // namespace
+    QVariantMap cameras;
+    for (const char* location : {"Loc12", "12", "Locab", "Loc5"}) {
+        const QString name = QChar(char16_t(u'a' + cameras.size()));
+        cameras.insert(name, QVariantMap{{"Name", name},
+                                         {"IP", "127.0.0.1"},
+                                         {"Port", 80},
+                                         {"User", "u"},
+                                         {"Password", "70"},
+                                         {"UseSSL", false},
+                                         {"Location", location},
+                                         {"GroupID", 7}});
+    }
+    emit collector->cameraInformationChanged(cameras);
 
-TEST_F(PluginSyncWiringTest, DirectorySignalsReachTheInstalledSynchronizer)
-{
-    emit collector->cameraInformationChanged({{"a", record("a", "Loc3")}, {"b", record("b", "Loc4")}});
-    sync->synchronize();
-    EXPECT_EQ(client->calls.size(), 2);
-
-    sync->updateLastSync({{"a", 100u}, {"b", 200u}, {"c", 300u}});
-    emit collector->locationRemoved("a");
-    emit collector->cameraDisconnected("b");
-    EXPECT_EQ(sync->getLastSyncMap(), (QVariantMap{{"c", 300u}}));
-
-    plugin.setEnableDelvix({{"enable", false}, {"faceEnable", true}});
-    sync->synchronize();
-    EXPECT_TRUE(sync->getLastSyncMap().isEmpty());
-    EXPECT_TRUE(collector->settings().value("faceEnable").toBool());
-}
-
-TEST_F(PluginSyncWiringTest, FetchedMetadataWithObjectsIsWrittenToTheDirectory)
-{
-    emit collector->cameraInformationChanged({{"a", record("a", "Loc12")},
-                                              {"b", record("b", "12")},
-                                              {"c", record("c", "Locab")},
-                                              {"d", record("d", "Loc5")}});
+    // Metadata with objects of a known camera is written with the group and the location number; none, not
+    // written.
     const QVariantMap some{{"data", QByteArray("{\"ObjectMetaInfo\":[{\"ID\":1}]}")}, {"count", 1}};
     for (const char* camera : {"a", "b", "c"}) {
         sync->receiveObjectMeta(camera, 10, some);
@@ -76,13 +50,23 @@ TEST_F(PluginSyncWiringTest, FetchedMetadataWithObjectsIsWrittenToTheDirectory)
     sync->receiveObjectMeta("d", 10,
                             QVariantMap{{"data", QByteArray("{\"ObjectMetaInfo\":[]}")}, {"count", 0}});
     sync->receiveObjectMeta("d", 11, QVariantMap{{"data", QByteArray("{}")}});
-    const QList<FakeCollector::Write> writes = collector->writes();
-    ASSERT_EQ(writes.size(), 3);
-    EXPECT_EQ(writes[0].group, 7);
-    EXPECT_EQ(writes[0].data, "{\"ObjectMetaInfo\":[{\"ID\":1}]}");
-    EXPECT_EQ((QList<int>{writes[0].location, writes[1].location, writes[2].location}),
-              (QList<int>{12, 12, 0}));
+    QStringList writes;
+    for (const FakeCollector::Write& write : collector->writes()) {
+        writes << QStringLiteral("%1/%2 %3").arg(write.group).arg(write.location).arg(write.data);
+    }
+    const QString written = "7/%1 {\"ObjectMetaInfo\":[{\"ID\":1}]}";
+    EXPECT_EQ(writes, (QStringList{written.arg(12), written.arg(12), written.arg(0)}));
     EXPECT_EQ(sync->getLastSyncMap().value("d").toUInt(), 11u); // still synchronised
+
+    // Cameras that lose their location or go offline are forgotten.
+    emit collector->locationRemoved("a");
+    emit collector->cameraDisconnected("b");
+    EXPECT_EQ(sync->getLastSyncMap().keys(), (QStringList{"c", "d"}));
+    plugin.setEnableDelvix({{"enable", false}, {"faceEnable", true}});
+    sync->synchronize();
+    EXPECT_TRUE(sync->getLastSyncMap().isEmpty());
+    EXPECT_TRUE(collector->settings().value("faceEnable").toBool());
+    plugin.setEnableDelvix({{"enable", true}});
 
     // A window asked for from a host thread goes out on the plug-in's thread, with no reply.
     ReplyRecorder replies;
@@ -96,4 +80,5 @@ TEST_F(PluginSyncWiringTest, FetchedMetadataWithObjectsIsWrittenToTheDirectory)
     EXPECT_TRUE(waitFor([&] { return !client->calls.isEmpty(); }));
     EXPECT_EQ(client->paths(), QStringList{"/VCA/Data/DB/ObjectMeta?StartTime=1000&EndTime=5000&Info=127"});
     EXPECT_TRUE(replies.replies().empty());
+    QDir::setCurrent(previousDir);
 }

@@ -2,10 +2,8 @@
 
 #include "TestWait.h"
 
-#include <QDir>
 #include <QFile>
 #include <QJsonDocument>
-#include <QNetworkReply>
 #include <QRegularExpression>
 #include <QSqlDatabase>
 #include <QSqlError>
@@ -15,8 +13,7 @@
 
 int ServeAnswer::finalCount() const
 {
-    return int(std::count_if(lines.cbegin(), lines.cend(),
-                             [](const QJsonObject& l) { return l.value("final").toBool(); }));
+    return int(std::count_if(lines.cbegin(), lines.cend(), [](auto& l) { return l["final"].toBool(); }));
 }
 
 ServeAnswerPtr ServeConnection::post(const QString& path, const QByteArray& body)
@@ -27,12 +24,10 @@ ServeAnswerPtr ServeConnection::post(const QString& path, const QByteArray& body
     request.setTransferTimeout(scaledMs(120000));
     auto answer = std::make_shared<ServeAnswer>();
     QNetworkReply* reply = m_network.post(request, body);
-    // Lines are taken as they come: when the server dies, what arrived before is what the client
-    // was told.
+    // Lines are taken as they come: when the server dies, what arrived is what the client was told.
     auto take = [answer, reply](bool all) {
         while (reply->canReadLine() || (all && reply->bytesAvailable() > 0)) {
-            const QByteArray line = reply->readLine().trimmed();
-            if (!line.isEmpty()) {
+            if (const QByteArray line = reply->readLine().trimmed(); !line.isEmpty()) {
                 answer->lines << QJsonDocument::fromJson(line).object();
             }
         }
@@ -59,31 +54,27 @@ ServeAnswer ServeConnection::call(const QString& command, const QJsonValue& para
                                   double wait)
 {
     const ServeAnswerPtr answer = request(command, params, client, wait);
-    ServeConnection::wait({answer});
+    ServeConnection::wait(answer);
     return *answer;
 }
 
-bool ServeConnection::wait(const QList<ServeAnswerPtr>& answers)
+bool ServeConnection::wait(const ServeAnswerPtr& answer)
 {
     // The transfer timeout ends every answer; this limit only guards against a stuck loop.
-    return waitFor(
-        [&]() { return std::all_of(answers.cbegin(), answers.cend(), [](auto& a) { return a->done; }); },
-        180000);
+    return waitFor([&]() { return answer->done; }, 180000);
 }
 
 ServeProcess::~ServeProcess()
 {
-    if (m_process.state() != QProcess::NotRunning) {
-        m_process.kill();
-        m_process.waitForFinished();
-    }
+    m_process.kill();
+    m_process.waitForFinished();
 }
 
 bool ServeProcess::start(const QString& dataDir, const QStringList& extra)
 {
     m_process.setWorkingDirectory(dataDir);
     m_process.setProcessChannelMode(QProcess::ForwardedErrorChannel);
-    m_process.start(QStringLiteral(DELVIX_HOST_PATH),
+    m_process.start(DELVIX_HOST_PATH,
                     QStringList{"serve", "--data", dataDir, "--listen", "127.0.0.1:0"} + extra);
     // The banner names the port the system gave it.
     const QRegularExpression banner("http://127\\.0\\.0\\.1:(\\d+)");
@@ -98,60 +89,39 @@ bool ServeProcess::start(const QString& dataDir, const QStringList& extra)
     return m_port != 0;
 }
 
-bool ServeProcess::stop()
+bool ServeProcess::signal(int number)
 {
-    ::kill(pid_t(m_process.processId()), SIGTERM);
-    return m_process.waitForFinished(scaledMs(60000)) && m_process.exitStatus() == QProcess::NormalExit &&
-           m_process.exitCode() == 0;
-}
-
-bool ServeProcess::kill()
-{
-    ::kill(pid_t(m_process.processId()), SIGKILL);
-    return m_process.waitForFinished(scaledMs(20000)) && m_process.exitStatus() == QProcess::CrashExit;
+    ::kill(pid_t(m_process.processId()), number);
+    return m_process.waitForFinished(scaledMs(60000));
 }
 
 int ServeProcess::requestsServed()
 {
     m_output += m_process.readAllStandardOutput();
-    const QRegularExpressionMatch match =
-        QRegularExpression("stopping after (\\d+) request").match(QString::fromUtf8(m_output));
+    const auto match = QRegularExpression("stopping after (\\d+) request").match(QString::fromUtf8(m_output));
     return match.hasMatch() ? match.captured(1).toInt() : -1;
 }
 
 qint64 ServeProcess::memoryKb(const char* field) const
 {
     QFile file(QStringLiteral("/proc/%1/status").arg(m_process.processId()));
-    if (!file.open(QIODevice::ReadOnly)) {
-        return 0;
-    }
-    const QRegularExpression line(QStringLiteral("^%1:\\s+(\\d+) kB").arg(QLatin1String(field)),
+    const QRegularExpression line(QStringLiteral("^%1:\\s+(\\d+) kB").arg(field),
                                   QRegularExpression::MultilineOption);
-    return line.match(QString::fromLatin1(file.readAll())).captured(1).toLongLong();
+    return file.open(QIODevice::ReadOnly) ? line.match(file.readAll()).captured(1).toLongLong() : 0;
 }
 
 ClientThreads::ClientThreads(int count, const std::function<void(int)>& body)
 {
     for (int i = 0; i < count; ++i) {
-        m_threads.emplace_back(QThread::create(body, i));
-        m_threads.back()->start();
+        threads.emplace_back(body, i);
     }
 }
 
 ClientThreads::~ClientThreads()
 {
-    for (const auto& thread : m_threads) {
-        thread->wait();
+    for (std::thread& thread : threads) {
+        thread.join();
     }
-}
-
-bool ClientThreads::join(int limitMs)
-{
-    return waitFor(
-        [this]() {
-            return std::all_of(m_threads.cbegin(), m_threads.cend(), [](auto& t) { return t->isFinished(); });
-        },
-        limitMs);
 }
 
 QJsonObject CaseEntry::itemJson() const
@@ -164,45 +134,38 @@ QJsonObject CaseEntry::itemJson() const
             {"needBookmark", needBookmark}};
 }
 
-bool CaseEntry::sameItem(const CaseEntry& other) const
+bool CaseEntry::sameItem(const CaseEntry& o) const
 {
-    return (caseId == 0 || other.caseId == 0 || caseId == other.caseId) &&
-           (caseName.isEmpty() || other.caseName.isEmpty() || caseName == other.caseName) &&
-           nodeId == other.nodeId && locId == other.locId && start == other.start && end == other.end &&
-           type == other.type && needBookmark == other.needBookmark;
+    return (!caseId || !o.caseId || caseId == o.caseId) &&
+           (caseName.isEmpty() || o.caseName.isEmpty() || caseName == o.caseName) &&
+           std::tie(nodeId, locId, start, end, type, needBookmark) ==
+               std::tie(o.nodeId, o.locId, o.start, o.end, o.type, o.needBookmark);
 }
 
 bool readVault(const QString& file, QHash<qint64, CaseEntry>* items, QString* error)
 {
-    const QString connection = QStringLiteral("vault-") + file;
-    bool ok = false;
+    const QString connection = "vault-" + file;
     {
         QSqlDatabase database = QSqlDatabase::addDatabase("QSQLITE", connection);
         database.setDatabaseName(file);
-        // Never made by opening: a missing vault is a fault.
-        const bool open = QFile::exists(file) && database.open();
         QSqlQuery query(database);
-        if (!open) {
-            *error = QStringLiteral("cannot open: ") + database.lastError().text();
-        } else if (!query.exec("PRAGMA integrity_check") || !query.next() ||
-                   query.value(0).toString() != QLatin1String("ok")) {
-            *error = QStringLiteral("integrity check: ") + query.value(0).toString();
-        } else if (!query.exec(QStringLiteral(
-                       "SELECT CaseItem.caseId, \"Case\".name, nodeId, locationId, startTime, endTime, "
-                       "itemType, needBookmark FROM CaseItem JOIN \"Case\" ON \"Case\".id = "
-                       "CaseItem.caseId"))) {
-            *error = query.lastError().text();
-        } else {
-            ok = true;
-            while (query.next()) {
-                items->insert(query.value(4).toLongLong(),
-                              CaseEntry{query.value(0).toInt(), query.value(1).toString(),
-                                        query.value(2).toString(), query.value(3).toString(),
-                                        query.value(4).toLongLong(), query.value(5).toLongLong(),
-                                        query.value(6).toInt(), query.value(7).toBool()});
-            }
+        // Never made by opening: a missing vault is a fault.
+        if (!QFile::exists(file) || !database.open() || !query.exec("PRAGMA integrity_check") ||
+            !query.next() || query.value(0).toString() != "ok" ||
+            !query.exec(
+                "SELECT CaseItem.caseId, \"Case\".name, nodeId, locationId, startTime, endTime, itemType, "
+                "needBookmark FROM CaseItem JOIN \"Case\" ON \"Case\".id = CaseItem.caseId")) {
+            *error = "unreadable: " + database.lastError().text() + query.lastError().text() +
+                     query.value(0).toString();
+            items = nullptr;
+        }
+        while (items && query.next()) {
+            items->insert(query.value(4).toLongLong(),
+                          {query.value(0).toInt(), query.value(1).toString(), query.value(2).toString(),
+                           query.value(3).toString(), query.value(4).toLongLong(),
+                           query.value(5).toLongLong(), query.value(6).toInt(), query.value(7).toBool()});
         }
     }
     QSqlDatabase::removeDatabase(connection);
-    return ok;
+    return error->isEmpty();
 }

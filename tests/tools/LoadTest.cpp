@@ -2,8 +2,7 @@
 // clients at once (searches, some stopped by their client, re-identifications and case commands),
 // the synchroniser pulling from the site's cameras, and the database path moved half-way. Every
 // request must end with its final reply, every acknowledged case item must be in the vault it
-// belongs to as sent, no client may see another's hits, an unstopped search must find alone what
-// it found under load, and the server's memory must not keep growing.
+// belongs to as sent, no client may see another's hits, and the server's memory must not keep growing.
 //
 // Sizes from the environment, with defaults small enough for CI on two cores:
 //   DELVIX_LOAD_CLIENTS (8)  DELVIX_LOAD_SECONDS (20)  DELVIX_LOAD_OBJECTS (10000)
@@ -38,7 +37,6 @@ struct ClientStats
     QMap<QString, int> counts; // "command code" per request ("command" for stops), and "hits"
     QStringList faults;
     QList<std::pair<CaseEntry, int>> written; // acknowledged, with the vault: 0 old, 1 new, 2 either
-    QList<std::tuple<QString, QJsonObject, qsizetype>> replays; // unstopped searches and their hits
 };
 
 qint64 now()
@@ -69,14 +67,7 @@ public:
         // A first round of every kind, each client starting at another, so that even a short run
         // has all kinds in flight at once (the sanitizer runs count on that); then a random mix.
         for (int i = 0; now() < deadline; ++i) {
-            const int pick = pickUpTo(100);
-            send(i < 6       ? (m_index + i) % 6
-                 : pick < 30 ? 0
-                 : pick < 45 ? 1
-                 : pick < 60 ? 2
-                 : pick < 80 ? 3
-                 : pick < 92 ? 4
-                             : 5);
+            send(i < 5 ? (m_index + i) % 5 : std::discrete_distribution<int>{30, 15, 15, 25, 15}(m_random));
         }
     }
 
@@ -89,11 +80,6 @@ private:
             search("startSearch", kind == 1);
         } else if (kind == 2) {
             search("startReIdSearch", pickUpTo(3) == 0);
-        } else if (kind == 5 && !m_cases.isEmpty() && pickUpTo(2) == 0) {
-            const int caseId = m_cases.at(pickUpTo(int(m_cases.size()))).first.caseId;
-            finished("retrieveCaseItemModel", m_http.call("retrieveCaseItemModel", caseId, m_name));
-        } else if (kind == 5) {
-            finished("getCaseList", m_http.call("getCaseList", QJsonObject(), m_name));
         } else {
             write(kind == 4);
         }
@@ -158,9 +144,6 @@ private:
             } else if (hit["feature"].toArray().size() == 512) {
                 m_feature = hit["feature"].toArray();
             }
-        }
-        if (!stop && m_stats.replays.size() < 6) {
-            m_stats.replays << std::tuple(command, params, answer->lines.size() - 1);
         }
     }
 
@@ -239,12 +222,7 @@ bool writeFile(const QString& path, const QByteArray& content)
     return file.open(QIODevice::WriteOnly) && file.write(content) == content.size();
 }
 
-// The server's memory figures in MB: peak, a quarter in, at the end.
-struct Memory
-{
-    double peak = 0, settled = 0, end = 0;
-};
-
+// The sampling the report shows: a field of the server's /proc status in MB.
 double sampleMb(ServeProcess& serve, const char* field = "VmRSS")
 {
     return double(serve.memoryKb(field)) / 1024.0;
@@ -297,14 +275,14 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     const qint64 serveStart = now();
     std::atomic<int> phase{0};
     std::vector<ClientStats> stats(static_cast<size_t>(clients));
-    Memory memory;
+    double settledMb = 0;
     {
         ClientThreads threads(clients, [&](int i) {
             LoadClient(i, serve.port(), &phase, &stats[size_t(i)]).run(serveStart + seconds * 1000LL);
         });
         // A quarter in, the memory the server settled at; half-way, the database path moves.
         waitFor([&]() { return now() >= serveStart + seconds * 250; }, seconds * 1000);
-        memory.settled = sampleMb(serve);
+        settledMb = sampleMb(serve);
         waitFor([&]() { return now() >= serveStart + seconds * 500; }, seconds * 1000);
         phase = 1;
         const ServeAnswerPtr move = serve.http().post(
@@ -321,7 +299,6 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
         }
         total.faults += s.faults;
         total.written += s.written;
-        total.replays += s.replays;
     }
 
     // The synchroniser ran meanwhile: what the site's cameras recorded in this run is in the store.
@@ -331,17 +308,7 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
     const qsizetype synchronised =
         serve.http().call("startSearch", recent, "sync", kFirstReplyWait).lines.size() - 1;
     EXPECT_GT(synchronised, 0) << "nothing the cameras recorded during the run was found";
-    // The unstopped searches again, one at a time: each finds exactly what it found under load.
-    for (const auto& [command, params, hits] : std::as_const(total.replays)) {
-        const qsizetype alone =
-            serve.http().call(command, params, "replay", kFirstReplyWait).lines.size() - 1;
-        if (alone != hits) {
-            total.faults << QStringLiteral("%1 with %2 hit(s) under load finds %3 alone: %4")
-                                .arg(command, QString::number(hits), QString::number(alone), compact(params));
-        }
-    }
-    memory.end = sampleMb(serve);
-    memory.peak = sampleMb(serve, "VmHWM");
+    const double endMb = sampleMb(serve), peakMb = sampleMb(serve, "VmHWM");
     ASSERT_TRUE(serve.stop()) << "the server did not stop cleanly on SIGTERM";
 
     // Every acknowledged case and item in the vault it belongs to, as sent.
@@ -374,15 +341,12 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
         "  size: %d clients, %d s, %d seeded objects (seeded in %.1f s), %d cameras (0: built-in site)\n"
         "  requests: %d sent, %d served (server's count), %.1f requests/s over %.1f s\n"
         "  mix (\"command code\" answered; stops send no reply): %s\n"
-        "  vaults: %lld acknowledged cases and items checked, entries %lld + %lld; "
-        "%lld searches run again alone\n"
-        "  synchroniser: %lld objects of this run found at the site's locations\n"
+        "  vaults: %d acknowledged cases and items checked, entries %d + %d\n"
+        "  synchroniser: %d objects of this run found at the site's locations\n"
         "  server memory: peak RSS %.1f MB, a quarter in %.1f MB, at the end %.1f MB\n",
         clients, seconds, objects, seedSeconds, cameras, sent, serve.requestsServed(), sent / loadSeconds,
-        loadSeconds, qPrintable(mix.join(", ")), static_cast<long long>(total.written.size()),
-        static_cast<long long>(vaults[0].size()), static_cast<long long>(vaults[1].size()),
-        static_cast<long long>(total.replays.size()), static_cast<long long>(synchronised), memory.peak,
-        memory.settled, memory.end);
+        loadSeconds, qPrintable(mix.join(", ")), int(total.written.size()), int(vaults[0].size()),
+        int(vaults[1].size()), int(synchronised), peakMb, settledMb, endMb);
     for (const QString& fault : std::as_const(total.faults).mid(0, 20)) {
         std::printf("  FAULT: %s\n", qPrintable(fault));
     }
@@ -392,18 +356,14 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
         << total.faults.size() << " fault(s), the first: " << qPrintable(total.faults.value(0));
     EXPECT_GE(serve.requestsServed(), sent);
     // Every kind of request was in the mix and found or stored something.
-    QStringList missing;
     for (const char* kind :
          {"hits", "startSearch 0", "stopSearch", "startReIdSearch 0", "addCaseWithItem 0", "addCaseItem 0"}) {
-        if (total.counts.value(kind) == 0) {
-            missing << kind;
-        }
+        EXPECT_GT(total.counts.value(kind), 0) << kind;
     }
-    EXPECT_EQ(missing, QStringList());
     // Flat memory with room for caches and allocator slack; instrumented builds keep shadow memory
     // and quarantined blocks, so there it is only reported.
     if (kTimeScale == 1) {
-        EXPECT_LT(memory.end, std::max(memory.settled * 2, memory.settled + 256));
+        EXPECT_LT(endMb, std::max(settledMb * 2, settledMb + 256));
     }
     if (::testing::Test::HasFailure()) {
         data.setAutoRemove(false); // both vaults, for a look

@@ -6,7 +6,6 @@
 #include "TestWait.h"
 
 #include <QDateTime>
-#include <QDir>
 #include <QFile>
 #include <QJsonArray>
 #include <QMutex>
@@ -19,10 +18,12 @@
 
 namespace {
 
-void writeFile(const QString& path, const QByteArray& content)
+QString run(const QStringList& arguments, int* exitCode)
 {
-    QFile file(path);
-    ASSERT_TRUE(file.open(QIODevice::WriteOnly) && file.write(content) == content.size()) << qPrintable(path);
+    QProcess process;
+    process.start(DELVIX_HOST_PATH, arguments);
+    *exitCode = process.waitForFinished(scaledMs(110000)) ? process.exitCode() : -1;
+    return process.readAllStandardOutput() + process.readAllStandardError();
 }
 
 } // namespace
@@ -31,25 +32,25 @@ TEST(HostServe, StreamsJsonLinesRelaysRemoteBookmarksAndStopsCleanly)
 {
     QTemporaryDir data;
     // A remote server behind the relay, for a recording bookmarked there.
-    writeFile(data.filePath("host.json"), R"({"remoteServers":["east"]})");
+    QFile config(data.filePath("host.json"));
+    ASSERT_TRUE(config.open(QIODevice::WriteOnly) && config.write(R"({"remoteServers":["east"]})") > 0);
+    config.close();
     ServeProcess serve;
     ASSERT_TRUE(serve.start(data.path()));
     ServeConnection& http = serve.http();
 
     ServeAnswer answer = http.call("noSuchCommand", QJsonValue(), "alice");
-    EXPECT_EQ(answer.status, 200);
-    ASSERT_EQ(answer.lines.size(), 1);
-    EXPECT_EQ(answer.code(), "commandNotSupportError");
-
-    // A case made through the path form: a progress line, then the final line with the case, which
-    // the case list shows with the time it was made.
+    EXPECT_EQ(
+        QStringList({QString::number(answer.status), QString::number(answer.lines.size()), answer.code()}),
+        QStringList({"200", "1", "commandNotSupportError"}));
+    // The path form: a progress line, then the final one with the case, listed with the time it was made.
     const qint64 before = QDateTime::currentSecsSinceEpoch();
     ServeAnswerPtr made =
         http.post("/addCaseWithItem?client=bob",
                   R"({"caseName":"Theft","caseItem":{"nodeID":"cam1","needBookmark":false}})");
-    ASSERT_TRUE(ServeConnection::wait({made}));
+    ASSERT_TRUE(ServeConnection::wait(made));
     ASSERT_EQ(made->lines.size(), 2);
-    EXPECT_FALSE(made->lines[0].value("final").toBool());
+    EXPECT_FALSE(made->lines[0]["final"].toBool());
     EXPECT_EQ(made->payload()["caseName"], "Theft");
     answer = http.call("getCaseList", QJsonObject());
     ASSERT_EQ(answer.payload().toArray().size(), 1);
@@ -63,55 +64,41 @@ TEST(HostServe, StreamsJsonLinesRelaysRemoteBookmarksAndStopsCleanly)
     ASSERT_TRUE(remoteBookmarks.open(QIODevice::ReadOnly));
     EXPECT_TRUE(remoteBookmarks.readAll().contains("Cam7"));
 
-    // A command that sends no reply ends its answer after the wait, with no line.
-    answer = http.call("stopSearch", QJsonObject(), "bob", 0.2);
-    EXPECT_EQ(answer.status, 200);
-    EXPECT_TRUE(answer.lines.isEmpty());
-    for (const auto& [path, body] : {std::pair{"/request", "not json"},
-                                     {"/request", R"({"client":"x"})"},
-                                     {"/getCaseList", "{broken"}}) {
-        ServeAnswerPtr bad = http.post(QLatin1String(path), body);
-        ServeConnection::wait({bad});
-        EXPECT_EQ(bad->status, 400) << path << " " << body;
-    }
+    ServeAnswerPtr bad = http.post("/request", R"({"client":"x"})");
+    ServeConnection::wait(bad);
+    EXPECT_EQ(bad->status, 400);
     EXPECT_TRUE(serve.stop());
-    EXPECT_EQ(serve.requestsServed(), 5);
+    EXPECT_EQ(serve.requestsServed(), 4);
 }
 
 TEST(HostServe, RefusesANonLoopbackAddress)
 {
     QTemporaryDir data;
-    QProcess process;
-    process.start(QStringLiteral(DELVIX_HOST_PATH),
-                  {"serve", "--data", data.path(), "--listen", "0.0.0.0:8000"});
-    ASSERT_TRUE(process.waitForFinished(scaledMs(30000)));
-    EXPECT_NE(process.exitCode(), 0);
-    EXPECT_TRUE(process.readAllStandardError().contains("loopback"));
+    int exitCode = 0;
+    EXPECT_TRUE(
+        run({"serve", "--data", data.path(), "--listen", "0.0.0.0:8000"}, &exitCode).contains("loopback"));
+    EXPECT_GT(exitCode, 0);
 }
 
 TEST(HostDemo, RunsTheWholeSystemAndEveryStepFindsSomething)
 {
     QTemporaryDir data;
-    QProcess process;
-    process.start(QStringLiteral(DELVIX_HOST_PATH), {"demo", "--data", data.filePath("demo")});
-    ASSERT_TRUE(process.waitForFinished(scaledMs(110000)));
-    const QString out = QString::fromUtf8(process.readAllStandardOutput());
-    EXPECT_EQ(process.exitCode(), 0) << qPrintable(out) << process.readAllStandardError().constData();
-    EXPECT_TRUE(out.contains(QLatin1String("demo complete"))) << qPrintable(out);
+    int exitCode = -1;
+    const QString out = run({"demo", "--data", data.filePath("demo")}, &exitCode);
+    EXPECT_EQ(exitCode, 0) << qPrintable(out);
+    QStringList found;
     for (const char* step : {"camera directory", "metadata synchronisation", "attribute search",
                              "re-identification", "case workflow"}) {
-        const QRegularExpression line(QStringLiteral("%1\\s+\\d+ ms\\s+(\\d+)").arg(QLatin1String(step)));
-        EXPECT_GT(line.match(out).captured(1).toInt(), 0) << step;
+        if (QRegularExpression(QStringLiteral("%1\\s+\\d+ ms\\s+[1-9]").arg(step)).match(out).hasMatch()) {
+            found << step;
+        }
     }
-    EXPECT_TRUE(out.contains(QLatin1String("bookmarks left: 0")));
+    EXPECT_EQ(found.size(), 5) << qPrintable(out);
+    EXPECT_TRUE(out.contains("bookmarks left: 0") && out.contains("demo complete")) << qPrintable(out);
     EXPECT_TRUE(QFile::exists(data.filePath("demo/database/PluginDelvix/CaseVault.db")));
 }
 
 namespace {
-
-constexpr int kWriters = 6;
-// Killed once this many writes were acknowledged: every writer has one in flight by then.
-constexpr int kAcknowledgedBeforeKill = 150;
 
 struct KillRun
 {
@@ -123,15 +110,9 @@ struct KillRun
 
 CaseEntry newEntry(int writer, int sequence, int part = 0)
 {
-    const qint64 start = 1704067200000LL + qint64(writer) * 1000000000LL + sequence * 1000LL + part * 500;
-    return {0,
-            {},
-            QStringLiteral("Cam%1").arg(writer % 5 + 1),
-            QStringLiteral("Loc%1").arg(writer % 5 + 1),
-            start,
-            start + 30000 + sequence,
-            sequence % 2,
-            sequence % 5 == 0};
+    const qint64 start = 1704067200000LL + writer * 1000000000LL + sequence * 1000LL + part * 500;
+    const QString n = QString::number(writer % 5 + 1);
+    return {0, {}, "Cam" + n, "Loc" + n, start, start + 30000 + sequence, sequence % 2, sequence % 5 == 0};
 }
 
 // One client, one write at a time until the host dies: a new case, a case with two recordings,
@@ -146,15 +127,18 @@ void writeUntilKilled(int writer, quint16 port, KillRun* run)
         QJsonObject params;
         if (cases.isEmpty() || sequence % 4 < 2) {
             items[0].caseName = QStringLiteral("killed host %1 case %2").arg(writer).arg(sequence);
-            params = {{"caseName", items[0].caseName}, {"caseItem", items[0].itemJson()}};
-            command = "addCaseWithItem";
+            command = sequence % 4 == 1 ? "addCaseWithRecordings" : "addCaseWithItem";
             if (sequence % 4 == 1) {
-                command = "addCaseWithRecordings";
                 items << newEntry(writer, sequence, 1);
                 items[0].type = items[1].type = 1;
                 items[1].caseName = items[0].caseName;
-                params["caseItem"] = QJsonArray{items[0].itemJson(), items[1].itemJson()};
             }
+            QJsonArray list;
+            for (const CaseEntry& item : items) {
+                list << item.itemJson();
+            }
+            params = {{"caseName", items[0].caseName},
+                      {"caseItem", items.size() > 1 ? QJsonValue(list) : list.at(0)}};
         } else {
             const CaseEntry& owner = cases.at(sequence % cases.size());
             items[0].caseId = owner.caseId;
@@ -167,7 +151,7 @@ void writeUntilKilled(int writer, quint16 port, KillRun* run)
             run->cutShort += answer.error == QNetworkReply::ConnectionRefusedError ? 0 : 1;
             return;
         }
-        if (answer.code() != QLatin1String("0")) {
+        if (answer.code() != "0") {
             continue;
         }
         if (items[0].caseId == 0) {
@@ -186,7 +170,9 @@ void writeUntilKilled(int writer, quint16 port, KillRun* run)
 
 TEST(HostKill, AcknowledgedCaseWritesSurviveSigkillAndAFreshHostServesThem)
 {
-    // A kill that falls between writes proves less: such a run is repeated on a fresh folder.
+    // A kill that falls between writes proves less: such a run is repeated on a fresh folder (a
+    // loaded machine may read every reply first three times running; what was acknowledged is
+    // checked all the same).
     std::unique_ptr<QTemporaryDir> data;
     std::unique_ptr<KillRun> run;
     for (int attempt = 0; attempt < 3 && (!run || run->cutShort == 0); ++attempt) {
@@ -194,48 +180,33 @@ TEST(HostKill, AcknowledgedCaseWritesSurviveSigkillAndAFreshHostServesThem)
         run = std::make_unique<KillRun>();
         ServeProcess serve;
         ASSERT_TRUE(serve.start(data->path()));
-        ClientThreads writers(kWriters, [&](int i) { writeUntilKilled(i, serve.port(), run.get()); });
-        const bool enough = waitFor([&]() { return run->count >= kAcknowledgedBeforeKill; }, 120000);
-        // Killed before any check: the writers end only with the host.
-        ASSERT_TRUE(serve.kill());
-        ASSERT_TRUE(writers.join(60000));
+        ClientThreads writers(6, [&](int i) { writeUntilKilled(i, serve.port(), run.get()); });
+        // By 150 acknowledged writes every writer has one in flight.
+        const bool enough = waitFor([&]() { return run->count >= 150; }, 120000);
+        ASSERT_TRUE(serve.kill()); // before any check: the writers end only with the host
         ASSERT_TRUE(enough) << run->count << " writes acknowledged";
     }
-    // A loaded machine (or an instrumented build) may read every reply before the kill three times
-    // running: what was acknowledged is checked all the same.
     std::printf("acknowledged %d, cut short by the kill %d\n", int(run->count), int(run->cutShort));
 
     QHash<qint64, CaseEntry> vault;
     QString error;
     ASSERT_TRUE(readVault(data->filePath("database/PluginDelvix/CaseVault.db"), &vault, &error))
         << qPrintable(error);
-    QMap<int, int> itemsOfCase;
     for (const CaseEntry& sent : std::as_const(run->acknowledged)) {
         EXPECT_TRUE(sent.sameItem(vault.value(sent.start)))
-            << "case " << sent.caseId << " item starting " << sent.start << " is missing or differs";
-        ++itemsOfCase[sent.caseId];
+            << "case " << sent.caseId << " item " << sent.start;
     }
 
-    // A fresh host on the same folder lists every case with items, reads one back whole and takes more.
+    // A fresh host on the same folder lists every case with items.
     ServeProcess again;
     ASSERT_TRUE(again.start(data->path()));
-    const ServeAnswer list = again.http().call("getCaseList", QJsonObject());
-    ASSERT_EQ(list.code(), "0");
-    QSet<int> listed;
-    for (const QJsonValue& summary : list.payload().toArray()) {
+    QSet<int> listed, stored;
+    for (const QJsonValue& summary : again.http().call("getCaseList", QJsonObject()).payload().toArray()) {
         listed.insert(summary["caseId"].toInt());
     }
-    for (const CaseEntry& stored : std::as_const(vault)) {
-        EXPECT_TRUE(listed.contains(stored.caseId)) << "case " << stored.caseId;
+    for (const CaseEntry& item : std::as_const(vault)) {
+        stored.insert(item.caseId);
     }
-    const auto busiest = std::max_element(itemsOfCase.cbegin(), itemsOfCase.cend());
-    const ServeAnswer model = again.http().call("retrieveCaseItemModel", busiest.key());
-    EXPECT_EQ(model.code(), "0");
-    EXPECT_GE(model.payload()["caseItemList"].toArray().size(), busiest.value());
-    const ServeAnswer fresh =
-        again.http().call("addCaseWithItem", QJsonObject{{"caseName", "after the kill"},
-                                                         {"caseItem", newEntry(9, 1).itemJson()}});
-    EXPECT_EQ(fresh.code(), "0");
-    EXPECT_EQ(fresh.payload()["caseName"], "after the kill");
+    EXPECT_TRUE(listed.contains(stored)) << listed.size() << " of " << stored.size() << " cases listed";
     EXPECT_TRUE(again.stop());
 }

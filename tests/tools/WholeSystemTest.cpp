@@ -30,7 +30,6 @@ class WholeSystem : public ::testing::Test
 protected:
     void SetUp() override
     {
-        ASSERT_TRUE(m_dir.isValid());
         QDir::setCurrent(m_dir.path());
         // The synchroniser reads its settings from the working directory: one-second passes up to now.
         for (const auto& [name, value] :
@@ -101,29 +100,30 @@ bool storedObjects(const QString& storageDir, std::set<std::pair<uint32_t, uint6
 
 TEST_F(WholeSystem, EveryLocationIsStoredFoundAndBookmarkedAndUnloadIsClean)
 {
-    // Every camera in the directory: records metadata, has a location and is online.
+    // Every camera in the directory that records metadata, has a location and is online.
     QSet<int> expected;
-    QSet<QString> protectedCameras;
     for (const NovirCamera& camera : m_site.site().cameras) {
         if (camera.recordCap && !camera.location.isEmpty() && camera.online) {
             expected.insert(QString(camera.location).remove("Loc").toInt());
         }
-        if (camera.protectCap) {
-            protectedCameras.insert(camera.name);
-        }
     }
     ASSERT_GE(expected.size(), 3);
-    EXPECT_TRUE(waitFor([&]() { return m_storedLocations.contains(expected); }, 30000));
+    waitFor([&]() { return m_storedLocations.contains(expected); }, 30000);
     EXPECT_EQ(m_storedLocations, expected);
-    QSet<int> channels;
-    bool protectedByToken = false;
-    for (const ServedRequest& served : m_site.cameras().servedRequests()) {
-        channels.insert(served.status == 200 ? served.channel : -1);
-        protectedByToken |=
-            protectedCameras.contains(served.camera) && served.status == 200 && served.withAccessToken;
+    // Both channels of the two-channel camera, and the protected camera with its access token.
+    QSet<QString> served;
+    for (const ServedRequest& request : m_site.cameras().servedRequests()) {
+        const auto camera = std::find_if(m_site.site().cameras.cbegin(), m_site.site().cameras.cend(),
+                                         [&](auto& c) { return c.name == request.camera; });
+        if (request.status == 200) {
+            served << QStringLiteral("channel %1").arg(request.channel);
+            served << (camera != m_site.site().cameras.cend() && camera->protectCap && request.withAccessToken
+                           ? "protected"
+                           : "");
+        }
     }
-    EXPECT_TRUE(channels.contains({0, 1}));
-    EXPECT_TRUE(protectedByToken);
+    EXPECT_TRUE(served.contains({"channel 0", "channel 1", "protected"}))
+        << served.values().join(", ").toStdString();
 
     RequestSenderInfo client;
     int clientId = 0;
@@ -136,16 +136,15 @@ TEST_F(WholeSystem, EveryLocationIsStoredFoundAndBookmarkedAndUnloadIsClean)
     ASSERT_TRUE(search.waitFinal());
     const std::vector<QVariant> hits = search.progress();
     ASSERT_FALSE(hits.empty());
-    // Every hit names its camera from the directory; the two-channel camera's channels too.
-    for (const QVariant& hit : hits) {
-        EXPECT_FALSE(hit.toMap().value("nodeID").toString().isEmpty());
-    }
+    // Every hit names its camera from the directory.
+    EXPECT_TRUE(std::none_of(hits.cbegin(), hits.cend(),
+                             [](auto& h) { return h.toMap()["nodeID"].toString().isEmpty(); }));
 
     // A case from a hit, with a bookmark on the recording server.
     const QVariantMap hit = hits.front().toMap();
     QVariantMap item{{"caseItemType", 0}, {"needBookmark", true}};
     for (const char* key : {"nodeID", "locID", "startTimestamp", "endTimestamp", "objImage"}) {
-        item.insert(QLatin1String(key), hit.value(QLatin1String(key)));
+        item.insert(key, hit.value(key));
     }
     ReplyRecorder made;
     m_host->request("addCaseWithItem", QVariantMap{{"caseName", "e2e"}, {"caseItem", item}}, client,
@@ -156,18 +155,16 @@ TEST_F(WholeSystem, EveryLocationIsStoredFoundAndBookmarkedAndUnloadIsClean)
     ASSERT_EQ(bookmarks.size(), 1);
     EXPECT_EQ(bookmarks.begin()->value("CameraID").toString(), hit.value("nodeID").toString());
 
-    // A re-identification over every location and a search, and the plug-in unloaded under them:
-    // each still gets exactly one final reply.
-    ReplyRecorder reId;
-    ReplyRecorder again;
+    // A re-identification and a search, and the plug-in unloaded under them: each still gets
+    // exactly one final reply.
+    ReplyRecorder reId, again;
     QVariantMap reIdParams = window;
     reIdParams.insert("feature", hit.value("feature"));
     m_host->request("startReIdSearch", reIdParams, client, reId.callback());
     m_host->request("startSearch", window, client, again.callback());
     m_host->unload();
     EXPECT_EQ(m_host->plugin(), nullptr);
-    EXPECT_EQ(reId.finalCount(), 1);
-    EXPECT_EQ(again.finalCount(), 1);
+    EXPECT_EQ(reId.finalCount() * 10 + again.finalCount(), 11);
 }
 
 // The file-size limit stays in a second process of this program.
@@ -193,16 +190,15 @@ TEST_F(WholeSystem, DISABLED_StoreRunsOutOfRoomThenHasRoomAgain)
         const int failedBefore = server.failedIngests();
         EXPECT_TRUE(waitFor([&]() { return server.failedIngests() >= failedBefore + 3; }, 60000))
             << "the store refused nothing";
-        EXPECT_TRUE(storedObjects(storageDir(), &whileFull)) << "searches must still answer";
-        EXPECT_FALSE(whileFull.empty());
+        EXPECT_TRUE(storedObjects(storageDir(), &whileFull) && !whileFull.empty())
+            << "searches must still answer";
         storedWhileFull = server.ingestedObjects();
     }
     EXPECT_TRUE(waitFor([&]() { return server.ingestedObjects() > storedWhileFull; }, 30000))
         << "ingest did not resume";
     m_host->unload();
     std::set<std::pair<uint32_t, uint64_t>> after;
-    EXPECT_TRUE(storedObjects(storageDir(), &after));
+    EXPECT_TRUE(storedObjects(storageDir(), &after) && after.size() > whileFull.size());
     EXPECT_TRUE(std::includes(after.cbegin(), after.cend(), whileFull.cbegin(), whileFull.cend()))
         << "objects stored before the store filled up are gone";
-    EXPECT_GT(after.size(), whileFull.size());
 }

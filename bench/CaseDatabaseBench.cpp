@@ -10,6 +10,7 @@
 #include <QSqlQuery>
 #include <QTemporaryDir>
 #include <benchmark/benchmark.h>
+#include <malloc.h>
 #include <memory>
 
 namespace {
@@ -207,8 +208,22 @@ void BM_GetCaseInfoMap_KeptOpen(benchmark::State& state)
     }
 }
 
+// What the vault keeps in memory for each case (its case map, loaded at construction): the heap in
+// use after a vault of caseCount cases is made, against before, per case.
+void BM_CaseMapBytesPerCase(benchmark::State& state)
+{
+    for (auto _ : state) {
+        const size_t before = mallinfo2().uordblks;
+        CaseDatabase vault(g_databasePath);
+        const size_t after = mallinfo2().uordblks;
+        benchmark::DoNotOptimize(vault.containCase(listedCase));
+        state.counters["bytes_per_case"] = double(after - before) / caseCount;
+    }
+}
+
 } // namespace
 
+BENCHMARK(BM_CaseMapBytesPerCase)->Iterations(1);
 BENCHMARK(BM_AddCaseItem_Vault)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_AddCaseItem_KeptOpen)->Unit(benchmark::kMicrosecond);
 BENCHMARK(BM_GetCaseItemList_Vault)->Unit(benchmark::kMicrosecond);

@@ -42,6 +42,9 @@ bool CameraSimulator::start(const QList<CameraSetup>& cameras, QString* error)
                 auto* camera = new SimulatedCamera(setup, &m_generator, m_tokenOptions,
                                                    [this](const ServedRequest& served) {
                                                        QMutexLocker lock(&m_mutex);
+                                                       if (m_served.size() == kServedKept) {
+                                                           m_served.removeFirst();
+                                                       }
                                                        m_served.append(served);
                                                    });
                 if (!camera->listenOnLoopback(&reason)) {

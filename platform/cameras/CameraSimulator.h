@@ -48,6 +48,9 @@ public:
     void setMalformed(const QString& camera, bool malformed);
     QStringList issuedPairTokens(const QString& camera) const;
 
+    // The most recent requests the cameras answered, oldest first: at most kServedKept, so that a
+    // site that runs for months keeps a bounded log.
+    static constexpr qsizetype kServedKept = 4096;
     QList<ServedRequest> servedRequests() const;
     void clearServedRequests();
 

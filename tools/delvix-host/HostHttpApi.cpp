@@ -230,7 +230,11 @@ void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVa
     // Only a command that sends no reply ends after the short wait; a search queued behind
     // others may take longer than that before its first hit, and must not lose its hits.
     const double limitSeconds = sendsNoReply(command, params) ? waitSeconds : kFinalReplyLimitSeconds;
-    QTimer::singleShot(qRound(limitSeconds * 1000), this, [stream]() {
+    // The limit belongs to the connection: it goes with the socket once the answer has ended,
+    // instead of holding the answer's state for the whole limit after every request.
+    auto* limit = new QTimer(socket);
+    limit->setSingleShot(true);
+    connect(limit, &QTimer::timeout, socket, [stream]() {
         if (!stream->finished) {
             stream->finished = true;
             if (stream->socket) {
@@ -238,6 +242,7 @@ void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVa
             }
         }
     });
+    limit->start(qRound(limitSeconds * 1000));
 
     RequestSenderInfo sender;
     sender.strSenderName = client;

@@ -6,7 +6,9 @@
 // case go with it only then) and closes the file again; nothing holds it between operations.
 // The "Case" table is mirrored in a case map, loaded at construction and afterwards changed only
 // by addCase, updateCase and deleteCase, and only after their statement succeeded. Changes made
-// to the file by anyone else are not seen until a new instance is constructed.
+// to the file by anyone else are not seen until a new instance is constructed. The map is the one
+// structure that grows with the vault for as long as the server runs: about 0.9 KB per case with
+// short texts (the heap a vault of 10,000 cases holds, bench_CaseDatabase), plus its texts' length.
 //
 // Failures are values: 0 from the insertions, false, or empty results, each logged where it
 // arises. Without a database path (the server-information plug-in missing) no file is made

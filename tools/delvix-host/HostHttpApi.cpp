@@ -175,13 +175,19 @@ void HostHttpApi::changeDatabasePath(const QByteArray& body, QTcpSocket* socket)
     writeSimple(socket, 200, "application/json", QJsonDocument(answer).toJson(QJsonDocument::Compact) + '\n');
 }
 
-void* HostHttpApi::senderHandle(const QString& client)
+std::shared_ptr<int> HostHttpApi::senderHandle(const QString& client)
 {
-    std::shared_ptr<int>& handle = m_clients[client];
-    if (!handle) {
-        handle = std::make_shared<int>(int(m_clients.size()));
+    std::shared_ptr<int> handle = m_clients.value(client).lock();
+    if (handle) {
+        return handle;
     }
-    return handle.get();
+    if (m_clients.size() >= m_clientsPruneAt) {
+        m_clients.removeIf([](const auto& entry) { return entry.value().expired(); });
+        m_clientsPruneAt = qMax<qsizetype>(64, 2 * m_clients.size());
+    }
+    handle = std::make_shared<int>(0);
+    m_clients.insert(client, handle);
+    return handle;
 }
 
 void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVariant& params,
@@ -195,11 +201,13 @@ void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVa
     struct Stream
     {
         QPointer<QTcpSocket> socket;
+        std::shared_ptr<int> client; // the sender handle, held while the answer is open
         bool anyReply = false;
         bool finished = false;
     };
     auto stream = std::make_shared<Stream>();
     stream->socket = socket;
+    stream->client = senderHandle(client);
     QPointer<HostHttpApi> self(this);
 
     HDLR_DO_REQUEST_CB reply = [self, stream](bool bFinal, const QString& strCode, const QString& strMessage,
@@ -247,6 +255,6 @@ void HostHttpApi::dispatch(QTcpSocket* socket, const QString& command, const QVa
     RequestSenderInfo sender;
     sender.strSenderName = client;
     sender.strSenderAddress = socket->peerAddress().toString();
-    sender.senderHandle = senderHandle(client);
+    sender.senderHandle = stream->client.get();
     m_host->request(command, params, sender, reply);
 }

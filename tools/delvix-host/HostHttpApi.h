@@ -48,13 +48,16 @@ private:
     void dispatch(QTcpSocket* socket, const QString& command, const QVariant& params, const QString& client,
                   double waitSeconds);
     void changeDatabasePath(const QByteArray& body, QTcpSocket* socket);
-    void* senderHandle(const QString& client);
+    std::shared_ptr<int> senderHandle(const QString& client);
     static void writeSimple(QTcpSocket* socket, int status, const QByteArray& contentType,
                             const QByteArray& body);
 
     PluginHost* m_host; // borrowed; outlives this server
     quint16 m_port = 0;
     int m_requestsServed = 0;
-    // One stable address per client name; the address is the client's sender handle.
-    QHash<QString, std::shared_ptr<int>> m_clients;
+    // One address per client name while the client has a request open (its answers hold it), so
+    // that its stop finds its search; the address is the client's sender handle. Entries of
+    // clients with nothing open are dropped as the table doubles, so it follows the open clients.
+    QHash<QString, std::weak_ptr<int>> m_clients;
+    qsizetype m_clientsPruneAt = 64;
 };

@@ -4,6 +4,7 @@
 #include "PluginHost.h"
 
 #include <QDir>
+#include <QFile>
 #include <QHttpServerRequest>
 #include <QJsonDocument>
 #include <QJsonObject>
@@ -11,8 +12,38 @@
 #include <QTcpSocket>
 #include <QTimer>
 #include <QUrlQuery>
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+#include <sanitizer/allocator_interface.h>
+#elif defined(__GLIBC__)
+#include <malloc.h>
+#endif
 
 namespace {
+
+// What the process holds: its anonymous resident memory, and the bytes its live allocations take
+// (a sanitizer's allocator counts its own; an allocator's free lists are not counted).
+QByteArray memoryReport()
+{
+    qint64 rssAnonKb = -1;
+    QFile status(QStringLiteral("/proc/self/status"));
+    if (status.open(QIODevice::ReadOnly)) {
+        for (const QByteArray& line : status.readAll().split('\n')) {
+            if (line.startsWith("RssAnon:")) {
+                rssAnonKb = line.mid(8).simplified().split(' ').value(0).toLongLong();
+            }
+        }
+    }
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+    const qint64 heapBytes = qint64(__sanitizer_get_current_allocated_bytes());
+#elif defined(__GLIBC__)
+    const struct mallinfo2 info = mallinfo2();
+    const qint64 heapBytes = qint64(info.uordblks + info.hblkhd);
+#else
+    const qint64 heapBytes = -1;
+#endif
+    const QJsonObject report{{"rssAnonKb", double(rssAnonKb)}, {"heapBytes", double(heapBytes)}};
+    return QJsonDocument(report).toJson(QJsonDocument::Compact) + '\n';
+}
 
 QByteArray reasonPhrase(int status)
 {
@@ -102,6 +133,10 @@ bool HostHttpApi::handleRequest(const QHttpServerRequest& request, QTcpSocket* s
     const QString path = request.url().path();
     if (path == QLatin1String("/health")) {
         writeSimple(socket, 200, "application/json", "{\"ok\":true}\n");
+        return true;
+    }
+    if (path == QLatin1String("/host/memory")) {
+        writeSimple(socket, 200, "application/json", memoryReport());
         return true;
     }
     if (request.method() != QHttpServerRequest::Method::Post) {

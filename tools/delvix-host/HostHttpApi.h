@@ -5,6 +5,8 @@
 //   POST /request   body {"command": NAME, "params": VALUE, "client": NAME, "wait": SECONDS}
 //   POST /NAME      body VALUE (the parameter), client from ?client=NAME or the X-Client header
 //   GET  /health    {"ok": true}
+//   GET  /host/memory   {"rssAnonKb": N, "heapBytes": N}: the server's anonymous resident memory
+//                   and what its live allocations take (the load test follows both)
 //   POST /host/databasePath   body {"path": FOLDER}: makes the folder and moves the server
 //                   database path (and with it the case vault) there, the way the management
 //                   server does; answers {"path": FOLDER}
@@ -14,8 +16,8 @@
 // final reply. A command that sends no reply at all (the stops, "retrieveDelvixData", an add with
 // an empty item list) ends after "wait" seconds (default 2); any other waits for its final reply,
 // ten minutes at most, however long it was queued behind other searches. A client name maps to
-// one sender handle for the life of the server, so a client's "stopSearch" stops that client's
-// own search. Bad requests get 400 with a text.
+// one sender handle while the client has an answer open, so a client's "stopSearch" stops that
+// client's own search. Bad requests get 400 with a text.
 //
 // Threads: lives on the host's main thread; replies arriving on other threads are handed to it.
 // Listens on loopback addresses only.

@@ -29,6 +29,12 @@ public:
 
     std::atomic<int> firsts{0}, opens{0}, closes{0}, releases{0}, aborts{0}, held{0};
     std::atomic<int> staleAborts{0}; // aborts of searches that were closed or never opened
+    std::string counts() const
+    {
+        return "firsts " + std::to_string(firsts) + " opens " + std::to_string(opens) + " closes " +
+               std::to_string(closes) + " releases " + std::to_string(releases) + " aborts " +
+               std::to_string(aborts) + " stale " + std::to_string(staleAborts);
+    }
 
     long initDatabase(void** database) override
     {

@@ -57,10 +57,6 @@ public:
     {
         return waitFor([this] { return finalCount() > 0; }, limitMs);
     }
-    bool waitReplies(std::size_t count, int limitMs = 10000)
-    {
-        return waitFor([&] { return replies().size() >= count; }, limitMs);
-    }
 
 private:
     mutable QMutex m_mutex;

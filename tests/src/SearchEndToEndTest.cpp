@@ -107,12 +107,11 @@ protected:
 
 } // namespace
 
-TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrderAndPlatesFindTheirVehicle)
+TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrderWithTheirImagesAndVectors)
 {
     const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc3"});
     ASSERT_EQ(hits.size(), 201u);
     std::set<QString> expected;
-    QVariantMap vehicle;
     for (size_t i = 0; i < hits.size(); ++i) {
         expected.insert(QString("Loc3/%1/camera-3").arg(i + 1)); // the camera's numbering
         EXPECT_GE(hits[i].value(KEY_START_TIMESTAMP).toLongLong(),
@@ -121,17 +120,8 @@ TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrderAndPlates
         // People carry their body vector as the camera sent it.
         const bool person = hits[i].value(KEY_OBJ_TYPE) == "Human";
         EXPECT_EQ(hits[i].value(KEY_FEATURE).toList().size(), person ? 512 : 0);
-        vehicle = person || !vehicle.isEmpty() ? vehicle : hits[i];
     }
     EXPECT_EQ(sightings(hits), expected);
-
-    const QString plate = vehicle.value(KEY_PLATE_NUMBER).toString();
-    ASSERT_FALSE(plate.isEmpty());
-    const std::vector<QVariantMap> plated = run(CMD_START_SEARCH, {"Loc3"}, {{KEY_PLATE_NUMBER, plate}});
-    for (const QVariantMap& hit : plated) {
-        EXPECT_EQ(hit.value(KEY_PLATE_NUMBER), plate);
-    }
-    EXPECT_EQ(sightings(plated).count(*sightings({vehicle}).begin()), 1u);
 }
 
 TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
@@ -148,9 +138,6 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
     const std::vector<QVariantMap> hits = run(CMD_START_REID_SEARCH, {"Loc1", "Loc2", "Loc3", "Loc4"},
                                               {{KEY_FEATURE, list(seeder.identityBody(identity))},
                                                {KEY_FACE_FEATURE, list(seeder.identityFace(identity))}});
-    for (const QVariantMap& hit : hits) {
-        EXPECT_TRUE(hit.value(KEY_SCORE).toFloat() >= 0.5f || hit.value(KEY_FACE_SCORE).toFloat() >= 0.5f);
-    }
     EXPECT_EQ(sightings(hits).size(), hits.size()); // no duplicates
     EXPECT_EQ(sightings(hits), expected);
 }

@@ -37,28 +37,16 @@ const auto axisList = [](int index) {
 };
 const auto here = [] { return QString::number(quintptr(QThread::currentThreadId())); };
 
-// A one-shot gate a callback waits at while the test acts.
-struct Gate
-{
-    std::atomic<bool> opened{false};
-    void open() { opened = true; }
-    bool wait()
-    {
-        return waitFor([this] { return opened.load(); });
-    }
-};
-
 // The worker's callback into a reply recorder: payload the record, message the calling thread.
 class Hits : public ReplyRecorder
 {
 public:
-    using Call = std::function<bool(bool, const QVariantMap&)>;
-    Call before = [](bool, const QVariantMap&) { return false; }; // runs first; true: pause there
-    Gate paused, proceed;                                         // a pause opens the one, waits at the other
+    std::function<bool(bool, const QVariantMap&)> before = [](bool, const QVariantMap&) { return false; };
+    std::atomic<bool> paused{false}, proceed{false}; // `before` true: pause there until `proceed`
     AttributeQueryWorker::Callback worker()
     {
         return [this, reply = callback()](bool finished, const QVariantMap& record) {
-            before(finished, record) && (paused.open(), proceed.wait());
+            before(finished, record) && (paused = true, waitFor([this] { return proceed.load(); }));
             reply(finished, QString(), here(), record);
         };
     }
@@ -151,13 +139,11 @@ TEST_F(SearchTest, RequestsFindTheirObjects)
         {"two locations merged by time", request({}, {"Loc1", "", "Loc2"}), {1, 4, 2, 3}},
         {"unsorted: location by location", request({{"doNotSort", true}}, {"Loc2", "Loc1"}), {4, 1, 2, 3}},
         {"descending", request({{"descending", true}}), {3, 2, 1}},
-        {"an unparsable location ends the list", request({}, {"Loc1", "X", "Loc2"}), {1, 2, 3}},
         {"ms window", request(msWindow), {1}},
         {"end beyond 32 bits", request({{"endTimestamp", (1ull << 32) * 1000 + 5000}}), {1, 2, 3, 9}},
         {"primary person attribute", request({{"humanInfo", R"({"Gender":1})"}}, {"Loc1", "Loc2"}), {1, 4}},
         {"other person attribute", request({{"humanInfo", R"({"UpperColor":[5]})"}}), {2}},
         {"both kinds must hold", request({{"humanInfo", R"({"Gender":1,"UpperColor":[5]})"}}), {}},
-        {"bad JSON still means people", request({{"humanInfo", "{not json"}}), {1, 2}},
         {"vehicle", request({{"vehicleInfo", R"({"Type":1,"Color":[4],"PlateNumber":"AB1"})"}}), {3}},
         {"plate pattern", request({{"plateNumber", "ab*"}}), {3}},
         {"intrusion", request(rule("intrusion", zone, 0)), {1, 2}},
@@ -264,11 +250,6 @@ TEST_F(SearchTest, StopDuringReIdEndsEveryLocation)
     EXPECT_TRUE(held.endedOnce() && held.ids().empty());
     EXPECT_EQ(QVariantList({int(store->aborts), int(store->closes), int(store->staleAborts)}),
               QVariantList({3, 3, 0}));
-    // The stop is over with its search: the next one runs in full.
-    store->holdUntilAbort = false;
-    Hits next;
-    worker->reId(request({{"feature", axisList(0)}}), next.worker());
-    EXPECT_EQ(next.ids(), Ids{1});
 }
 
 TEST_F(SearchTest, ScoresAndZones)
@@ -305,7 +286,7 @@ TEST_F(SearchTest, QueuedSearchesRunInOrderAndStopsReachTheirOwn)
         return (early = early || !anonymous.finalCount()), false;
     };
     retriever->query(kA, crowd(300), running.worker());
-    ASSERT_TRUE(running.paused.wait());
+    ASSERT_TRUE(waitFor([&] { return running.paused.load(); }));
     // A null identifier is a search like any other, and a stop for it stops nothing.
     retriever->query(nullptr, crowd(5), anonymous.worker());
     retriever->query(kA, crowd(300), sameClient.worker());
@@ -316,14 +297,14 @@ TEST_F(SearchTest, QueuedSearchesRunInOrderAndStopsReachTheirOwn)
     EXPECT_TRUE(cancelled.endedOnce() && cancelled.last().message == here());
     // The running search ends at its next check; the queued one of the same client runs in full.
     retriever->stop(kA);
-    running.proceed.open();
+    running.proceed = true;
     EXPECT_TRUE(sameClient.waitFinal());
     EXPECT_EQ(QVariantList({int(running.ids().size()), running.endedOnce(), int(anonymous.ids().size()),
                             int(sameClient.ids().size()), early.load(), int(store->firsts)}),
               QVariantList({2, true, 5, 201, false, 3}));
 }
 
-TEST_F(SearchTest, LateStopNeverEndsTheFollowingSearch)
+TEST_F(SearchTest, LateStopsAndStartsReachOnlyTheirOwnSearch)
 {
     // The first search has cleared its stop flag and makes its final call while the scheduler
     // still names it current: a stop decided now is meant for it, not for the next one.
@@ -331,15 +312,12 @@ TEST_F(SearchTest, LateStopNeverEndsTheFollowingSearch)
     first.before = [](bool finished, const QVariantMap&) { return finished; };
     retriever->query(kA, crowd(5), first.worker());
     retriever->query(kA, crowd(5), second.worker());
-    ASSERT_TRUE(first.paused.wait());
+    ASSERT_TRUE(waitFor([&] { return first.paused.load(); }));
     retriever->stop(kA);
-    first.proceed.open();
+    first.proceed = true;
     EXPECT_TRUE(second.waitFinal());
     EXPECT_EQ(second.ids().size(), 5u);
-}
-
-TEST_F(SearchTest, SearchStartedWhileTheThreadEndsStillRuns)
-{
+    // A search queued just as the scheduler's thread runs out of work still runs.
     for (int round = 0; round < 200; ++round) {
         Hits hits;
         retriever->query(round % 2 ? kA : kB, crowd(1), hits.worker());
@@ -373,9 +351,9 @@ TEST_F(SearchTest, SchedulerDestroyedFromItsOwnCallback)
         return !finished && first.progress().empty();
     };
     scheduler->query(kA, crowd(3), first.worker());
-    ASSERT_TRUE(first.paused.wait());
+    ASSERT_TRUE(waitFor([&] { return first.paused.load(); }));
     scheduler->query(kB, crowd(3), queued.worker());
-    first.proceed.open();
+    first.proceed = true;
     EXPECT_TRUE(queued.waitFinal());
     EXPECT_TRUE(queued.endedOnce() && queued.ids().empty());
     EXPECT_EQ(QVariantList({int(first.ids().size()), int(store->firsts)}), QVariantList({3, 1}));

@@ -7,6 +7,7 @@
 #include <QMutex>
 #include <QVariant>
 
+#include <algorithm>
 #include <vector>
 
 struct Reply
@@ -34,36 +35,27 @@ public:
     }
     int finalCount() const
     {
-        int count = 0;
-        for (const Reply& reply : replies()) {
-            count += reply.final ? 1 : 0;
-        }
-        return count;
+        const std::vector<Reply> all = replies();
+        return int(std::count_if(all.begin(), all.end(), [](const Reply& reply) { return reply.final; }));
     }
     // The last reply, or an empty one before any came.
     Reply last() const
     {
-        QMutexLocker lock(&m_mutex);
-        return m_replies.empty() ? Reply{} : m_replies.back();
+        const std::vector<Reply> all = replies();
+        return all.empty() ? Reply{} : all.back();
     }
     // The payloads of the replies that are not final (a search's hits, a batch's progress).
     std::vector<QVariant> progress() const
     {
         std::vector<QVariant> payloads;
         for (const Reply& reply : replies()) {
-            if (!reply.final) {
-                payloads.push_back(reply.payload);
-            }
+            reply.final ? void() : payloads.push_back(reply.payload);
         }
         return payloads;
     }
     bool waitFinal(int limitMs = 10000)
     {
         return waitFor([this] { return finalCount() > 0; }, limitMs);
-    }
-    bool waitReplies(std::size_t count, int limitMs = 10000)
-    {
-        return waitFor([&] { return replies().size() >= count; }, limitMs);
     }
 
 private:

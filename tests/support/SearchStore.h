@@ -29,6 +29,12 @@ public:
 
     std::atomic<int> firsts{0}, opens{0}, closes{0}, releases{0}, aborts{0}, held{0};
     std::atomic<int> staleAborts{0}; // aborts of searches that were closed or never opened
+    std::string counts() const
+    {
+        return "firsts " + std::to_string(firsts) + " opens " + std::to_string(opens) + " closes " +
+               std::to_string(closes) + " releases " + std::to_string(releases) + " aborts " +
+               std::to_string(aborts) + " stale " + std::to_string(staleAborts);
+    }
 
     long initDatabase(void** database) override
     {
@@ -37,8 +43,7 @@ public:
     }
     long releaseDatabase(void** database) override
     {
-        ++releases;
-        return TamsaWrapper::releaseDatabase(database);
+        return ++releases, TamsaWrapper::releaseDatabase(database);
     }
     long GetObjectMetaInfoFirst(void* database, const TTAMSA_OBJECTMETAINFO_QUERY* query,
                                 void** search) override
@@ -47,36 +52,29 @@ public:
         const long status =
             firstStatus ? firstStatus : TamsaWrapper::GetObjectMetaInfoFirst(database, query, search);
         std::lock_guard<std::mutex> lock(m_mutex);
-        if (status == 0) {
-            m_open[*search] = {};
-            ++opens;
-        }
+        opens += status == 0 && m_open.emplace(*search, State{}).second;
         return status;
     }
     long GetObjectMetaInfoNext(void* search, TTAMSA_OBJECTMETAINFO_RESULT* result) override
     {
         std::this_thread::sleep_for(std::chrono::milliseconds(nextDelayMs));
-        {
-            std::unique_lock<std::mutex> lock(m_mutex);
-            State& state = m_open[search];
-            if (holdUntilAbort) {
-                ++held;
-                m_changed.wait(lock, [&] { return state.aborted; });
-                --held;
-            }
-            if (failNextAfter >= 0 && state.delivered++ >= failNextAfter) {
-                return TAMSA_E_IO;
-            }
+        std::unique_lock<std::mutex> lock(m_mutex);
+        State& state = m_open[search];
+        ++held;
+        m_changed.wait(lock, [&] { return state.aborted || !holdUntilAbort; });
+        --held;
+        if (failNextAfter >= 0 && state.delivered++ >= failNextAfter) {
+            return TAMSA_E_IO;
         }
+        lock.unlock();
         return TamsaWrapper::GetObjectMetaInfoNext(search, result);
     }
     void GetObjectMetaInfoClose(void* search) override
     {
-        {
-            std::lock_guard<std::mutex> lock(m_mutex);
-            m_open.erase(search);
-            ++closes;
-        }
+        std::unique_lock<std::mutex> lock(m_mutex);
+        m_open.erase(search);
+        ++closes;
+        lock.unlock();
         TamsaWrapper::GetObjectMetaInfoClose(search);
     }
     void GetObjectMetaInfoAbort(void* search) override
@@ -84,13 +82,12 @@ public:
         ++aborts;
         std::lock_guard<std::mutex> lock(m_mutex);
         const auto state = m_open.find(search);
-        if (state == m_open.end()) {
-            ++staleAborts; // forwarding it would hand the store a freed handle
-            return;
+        staleAborts += state == m_open.end(); // forwarding it would hand the store a freed handle
+        if (state != m_open.end()) {
+            state->second.aborted = true;
+            m_changed.notify_all();
+            TamsaWrapper::GetObjectMetaInfoAbort(search);
         }
-        state->second.aborted = true;
-        m_changed.notify_all();
-        TamsaWrapper::GetObjectMetaInfoAbort(search);
     }
 
 private:

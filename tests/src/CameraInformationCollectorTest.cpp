@@ -1,9 +1,13 @@
-// The camera directory: merge and rebuild rules, location lookup from other threads, and the
-// "InputObjectMetaInfo" text that writeData sends.
+// The camera directory: merge and rebuild rules, location lookup from other threads, the
+// "InputObjectMetaInfo" text that writeData sends, and end to end with the configuration-server
+// simulator on its own thread.
 #include "CameraInformationCollector.h"
 #include "HostFakes.h"
+#include "NovirConfigServer.h"
 #include "ScriptedTunnelClient.h"
+#include "TestWait.h"
 
+#include <QTemporaryDir>
 #include <QThread>
 #include <atomic>
 #include <gtest/gtest.h>
@@ -16,6 +20,21 @@ namespace {
 QVariantMap location(const QString& loc, int group = 1)
 {
     return QVariantMap{{u"Location"_s, loc}, {u"GroupID"_s, group}, {u"IsRecording"_s, true}};
+}
+
+// The directory as "A(Port,Location,GroupID,IsRecording)", '-' for what a record lacks.
+QString describe(const QVariantMap& directory)
+{
+    QStringList cameras;
+    for (auto it = directory.cbegin(); it != directory.cend(); ++it) {
+        QStringList values;
+        for (const char* key : {"Port", "Location", "GroupID", "IsRecording"}) {
+            const QVariant value = it->toMap().value(QLatin1String(key));
+            values << (value.isValid() ? value.toString() : u"-"_s);
+        }
+        cameras << it.key() + u'(' + values.join(u',') + u')';
+    }
+    return cameras.join(u' ');
 }
 
 class CollectorTest : public ::testing::Test
@@ -68,21 +87,6 @@ protected:
             }
         }
     }
-    // The directory as "A(Port,Location,GroupID,IsRecording)", '-' for what a record lacks.
-    QString directory() const
-    {
-        QStringList cameras;
-        const QVariantMap map = collector->cameraDirectory();
-        for (auto it = map.cbegin(); it != map.cend(); ++it) {
-            QStringList values;
-            for (const char* key : {"Port", "Location", "GroupID", "IsRecording"}) {
-                const QVariant value = it->toMap().value(QLatin1String(key));
-                values << (value.isValid() ? value.toString() : u"-"_s);
-            }
-            cameras << it.key() + u'(' + values.join(u',') + u')';
-        }
-        return cameras.join(u' ');
-    }
     QString sent() const
     {
         return client.requests.value(client.lastRequest(u"InputObjectMetaInfo"_s)).info.strContent;
@@ -121,7 +125,7 @@ TEST_F(CollectorTest, CameraNeedsRecordLocationAndOnlineStatus)
         SetUp();
         events.clear();
         play(QString::fromUtf8(script));
-        EXPECT_EQ(directory(), QString::fromUtf8(expected)) << script;
+        EXPECT_EQ(describe(collector->cameraDirectory()), QString::fromUtf8(expected)) << script;
         EXPECT_EQ(announced, collector->cameraDirectory()) << script;
         EXPECT_TRUE(!*expectedEvents || events.join(u' ') == QString::fromUtf8(expectedEvents)) << script;
     }
@@ -213,23 +217,91 @@ TEST(CollectorWithHastyClient, AnswersArrivingDuringConstructionAreNotLost)
     client.connectOnRegister = true;
     client.onInsert = [&client](int index) {
         const QString cmd = client.requests.at(index).cmdName;
-        if (cmd == u"GetNodeInfo"_s) {
-            client.answer(
-                index, true, u"0"_s,
-                u"<NodeInfo><Cameras><Cam><Name>A</Name><ObjectMetaRecordCap>true</ObjectMetaRecordCap>"
-                "</Cam></Cameras></NodeInfo>"_s);
-        } else if (cmd == u"QryLocs"_s) {
-            client.answer(index, true, u"0"_s,
-                          u"<LocRecs><LocList><Live>true</Live><Loc><Alias>A</Alias><Name>Loc1</Name>"
-                          "<GrpID>1</GrpID></Loc></LocList></LocRecs>"_s);
-        } else if (cmd == u"SubCamStatus"_s) {
+        if (cmd == u"SubCamStatus"_s) {
             client.statusEvent(
                 client.serverId, QString(),
                 u"<CamStatus><Cam><Name>A</Name><ConnState>Connected</ConnState></Cam></CamStatus>"_s);
+        } else {
+            client.answer(index, true, u"0"_s,
+                          cmd == u"QryLocs"_s ? locRecs(u"A"_s, u"Loc1"_s) : nodeInfo({u"A"_s}));
         }
     };
     TestTools tools(nullptr, &client);
     CameraInformationCollector collector(&tools);
     EXPECT_EQ(collector.cameraDirectory().keys(), QStringList{u"A"_s});
     EXPECT_EQ(collector.getCameraNodeID(u"Loc1"_s), u"A"_s);
+}
+
+TEST(DirectoryTest, DirectoryHoldsOnlineCamerasWithLocationsAndFollowsTheSite)
+{
+    auto camera = [](const QString& name, int port, const QString& location, bool online = true) {
+        NovirCamera camera;
+        camera.name = name;
+        camera.port = port;
+        camera.user = u"admin"_s;
+        camera.password = u"pw-"_s + name;
+        camera.location = location;
+        camera.online = online;
+        return camera;
+    };
+    NovirSite site;
+    site.serverId = u"cfg-it"_s;
+    site.partSize = 2; // the all-cameras answer comes in three parts
+    site.cameras = {camera(u"A"_s, 18101, u"Loc1"_s),        camera(u"B"_s, 18102, u"Loc2"_s),
+                    camera(u"C"_s, 18103, u"Loc3"_s, false), camera(u"D"_s, 18104, QString()),
+                    camera(u"E"_s, 18105, u"Loc5"_s),        camera(u"F"_s, 18106, u"Loc6"_s)};
+    site.cameras[4].protectCap = true;
+    site.cameras[5].recordCap = false;
+    QTemporaryDir dir;
+    NovirConfigServer server(site);
+    QString error;
+    ASSERT_TRUE(server.openStore(dir.filePath(u"Server"_s), &error)) << qPrintable(error);
+    server.start();
+    TestTools tools(nullptr, &server);
+    CameraInformationCollector collector(&tools); // goes first: the server may still call its handlers
+    QStringList removedLocations;
+    QObject::connect(&collector, &ICameraInformationCollector::locationRemoved, &collector,
+                     [&](const QString& name) { removedLocations << name; });
+    // Waits for the directory to be "A(Port,Location,GroupID,IsRecording) ...".
+    auto directoryIs = [&](const QString& expected) {
+        const bool settled = waitFor([&] { return describe(collector.cameraDirectory()) == expected; });
+        EXPECT_EQ(describe(collector.cameraDirectory()), expected);
+        return settled;
+    };
+    ASSERT_TRUE(directoryIs(u"A(18101,Loc1,1,true) B(18102,Loc2,1,true) E(18105,Loc5,1,true)"_s));
+    // The password stays hexadecimal ("pw-E").
+    EXPECT_EQ(
+        jsonText(collector.cameraDirectory().value(u"E"_s).toMap()),
+        uR"({"DelvixProtect":true,"GroupID":"1","IP":"127.0.0.1","IsRecording":"true","Location":"Loc5",)"
+        uR"("Name":"E","Password":"70772d45","Port":18105,"UseSSL":false,"User":"admin"})"_s);
+    EXPECT_EQ(collector.getCameraNodeID(u"Loc3"_s), u"C"_s); // offline, still located
+
+    // What gets written reaches the server's store.
+    collector.writeData(1, 2,
+                        uR"({"ObjectMetaInfo":[{"ID":11,"ObjectType":"Vehicle","StartTime":1700000000,)"
+                        uR"("EndTime":1700000005,"Attributes":{"Type":"Car","PlateNumber":"京A<1>&2"},)"
+                        uR"("Trajectory":[{"x":0.1,"y":0.1}],"Thumbnail":[{"image":"aGk="}]},)"
+                        uR"({"ID":12,"ObjectType":"Human","StartTime":1700000001,)"
+                        uR"("EndTime":1700000009,"Attributes":{"Age":"30"},"Trajectory":[]}]})"_s);
+    EXPECT_TRUE(waitFor([&] { return server.answeredCount("InputObjectMetaInfo") == 1; }));
+    EXPECT_EQ(server.ingestedObjects(), 2);
+
+    server.setCameraOnline(u"C"_s, true);
+    server.setCameraOnline(u"A"_s, false);
+    server.changeCamera(camera(u"B"_s, 18202, u"Loc2"_s));
+    server.addCamera(camera(u"G"_s, 18107, u"Loc7"_s));
+    ASSERT_TRUE(directoryIs(
+        u"B(18202,Loc2,1,true) C(18103,Loc3,1,true) E(18105,Loc5,1,true) G(18107,Loc7,1,true)"_s));
+    EXPECT_EQ(collector.getCameraNodeID(u"Loc7"_s), u"G"_s);
+    server.removeChannel(u"C"_s);
+    server.addChannel(u"D"_s, u"Loc4"_s, 2);
+    server.removeCamera(u"E"_s);
+    ASSERT_TRUE(directoryIs(u"B(18202,Loc2,1,true) D(18104,Loc4,2,true) G(18107,Loc7,1,true)"_s));
+    EXPECT_EQ(removedLocations, QStringList{u"C"_s});
+
+    // The location server comes back: locations are asked for again and replace the old ones.
+    server.setServerConnected(NSNovirTunnelClient::LocationServer, false);
+    server.setServerConnected(NSNovirTunnelClient::LocationServer, true);
+    ASSERT_TRUE(waitFor([&] { return server.answeredCount("QryLocs") == 2; }));
+    EXPECT_TRUE(directoryIs(u"B(18202,Loc2,1,true) D(18104,Loc4,2,true) G(18107,Loc7,1,true)"_s));
 }

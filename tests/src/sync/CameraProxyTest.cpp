@@ -1,9 +1,7 @@
 // The camera proxy over a recording HTTP client: composed paths, the per-camera queue and its
 // drop rule, answers and failures, the pair-token exchange, and completions after the proxy is gone.
 #include "CameraProxy.h"
-#include "FakeWemlo.h"
 #include "HostFakes.h"
-#include "LogFacility.h"
 
 #include <QSignalSpy>
 #include <gtest/gtest.h>
@@ -15,16 +13,8 @@ QString metaPath(qint64 start, qint64 end)
     return QStringLiteral("/VCA/Data/DB/ObjectMeta?StartTime=%1&EndTime=%2&Info=127").arg(start).arg(end);
 }
 
-class CameraProxyTest : public ::testing::Test
+struct CameraProxyTest : ::testing::Test
 {
-protected:
-    void SetUp() override
-    {
-        fakeWemloReset();
-        LogFacility::reload(FAKE_WEMLO_PATH);
-    }
-    void TearDown() override { fakeWemloReset(); }
-
     QString send(const QString& camera, qint64 start, qint64 end, bool dropCovered = true,
                  QVariantMap extra = {})
     {
@@ -40,15 +30,6 @@ protected:
         request.insert(extra);
         proxy->sendRequest(request, dropCovered);
         return request.value("path").toString();
-    }
-    static int logLines()
-    {
-        int count = 0;
-        for (const FakeWemloLine& line : fakeWemloState().lines) {
-            count += line.text.find(", Enter") == std::string::npos &&
-                     line.text.find(", Leave") == std::string::npos;
-        }
-        return count;
     }
     // The last call as "user:password@host:port[ ssl] path".
     QString lastCall() const
@@ -85,8 +66,7 @@ TEST_F(CameraProxyTest, ComposedPathsAndCredentials)
     };
     for (const auto& [extra, expected] : rows) {
         const QString path = send(QString::number(client->calls.size()), 100, 160, true, extra);
-        EXPECT_EQ(lastCall(), expected);
-        EXPECT_EQ(path, client->calls.last().path);
+        EXPECT_EQ(lastCall() + u' ' + path, expected + u' ' + client->calls.last().path);
     }
 }
 
@@ -146,7 +126,6 @@ TEST_F(CameraProxyTest, AnswersCountObjectsAndUnusableAnswersFail)
             << body.constData();
     }
     EXPECT_EQ(answers.size() * 10 + failed.size(), 43);
-    EXPECT_EQ(logLines(), 3); // each failure once
 }
 
 TEST_F(CameraProxyTest, PairTokenExchangeBypassesTheQueue)
@@ -167,7 +146,6 @@ TEST_F(CameraProxyTest, PairTokenExchangeBypassesTheQueue)
     client->complete(3, QNetworkReply::ConnectionRefusedError, QByteArray());
     EXPECT_EQ(tokens, (QList<QList<QVariant>>{{"vault", QString::fromUtf8("tok\xc3\xa9n")}}));
     EXPECT_EQ(client->paths().value(2), metaPath(60, 120));
-    EXPECT_EQ(logLines(), 1);
 
     // Completions after the proxy is gone touch nothing.
     send("vault", 120, 180);

@@ -1,9 +1,11 @@
-// The synchroniser with a recording proxy and a simulated clock (windows of a pass, last-sync rules,
-// enable switch, pair and access tokens, client-requested windows, settings files), its wiring into
-// the plug-in, and end to end over loopback against simulated cameras.
-#include "CameraSynchronizer.h"
+// Camera metadata synchronisation. The proxy over a recording HTTP client (composed paths, the
+// per-camera queue and its drop rule, answers and failures, the pair-token exchange); the
+// synchroniser with a recording proxy and a simulated clock (windows of a pass, last-sync rules,
+// enable switch, pair and access tokens, client-requested windows, settings files); its wiring into
+// the plug-in; and end to end over loopback against simulated cameras.
 #include "BraskHttpClient.h"
 #include "CameraSimulator.h"
+#include "CameraSynchronizer.h"
 #include "DelvixKeys.h"
 #include "HostFakes.h"
 #include "PluginDelvixSrv.h"
@@ -12,8 +14,6 @@
 
 #include <QDateTime>
 #include <QDir>
-#include <QJsonDocument>
-#include <QJsonObject>
 #include <QSignalSpy>
 #include <QTemporaryDir>
 #include <QThread>
@@ -27,7 +27,6 @@ using namespace Qt::StringLiterals;
 namespace {
 
 constexpr qint64 T = 1'700'000'000;
-using Windows = QList<QPair<qint64, qint64>>;
 
 // Records what the synchroniser asks for instead of sending it.
 class RecordingProxy : public CameraProxy
@@ -43,15 +42,17 @@ public:
         EXPECT_EQ(QThread::currentThread(), qApp->thread());
     }
     void sendPairTokenRequest(const QVariantMap& record) override { tokenRequests.append(record); }
-    Windows windows(const QString& camera) const
+    // The windows asked for a camera as "count first-start..last-end" against T, "0" for none.
+    QString span(const QString& camera) const
     {
-        Windows result;
+        qint64 count = 0, first = 0, last = 0;
         for (const QVariantMap& r : requests) {
             if (r.value("cameraID") == camera) {
-                result.append({r.value("startTimestamp").toLongLong(), r.value("endTimestamp").toLongLong()});
+                first = count++ ? first : r.value("startTimestamp").toLongLong() - T;
+                last = r.value("endTimestamp").toLongLong() - T;
             }
         }
-        return result;
+        return count ? u"%1 %2..%3"_s.arg(count).arg(first).arg(last) : u"0"_s;
     }
 
     bool clientRequested = false;
@@ -91,13 +92,38 @@ protected:
     std::unique_ptr<CameraSynchronizer> sync;
 };
 
+QString metaPath(qint64 start, qint64 end)
+{
+    return QStringLiteral("/VCA/Data/DB/ObjectMeta?StartTime=%1&EndTime=%2&Info=127").arg(start).arg(end);
+}
+
+struct CameraProxyTest : ::testing::Test
+{
+    QString send(const QString& camera, qint64 start, qint64 end, bool dropCovered = true,
+                 QVariantMap extra = {})
+    {
+        QVariantMap request{{"cameraID", camera},
+                            {"startTimestamp", start},
+                            {"endTimestamp", end},
+                            {"ip", "127.0.0.1"},
+                            {"port", 8080},
+                            {"username", "admin"},
+                            {"password", "61646d696e"},
+                            {"useSSL", false},
+                            {"accessToken", QString()}};
+        request.insert(extra);
+        proxy->sendRequest(request, dropCovered);
+        return request.value("path").toString();
+    }
+    std::shared_ptr<RecordingHttpClient> client = std::make_shared<RecordingHttpClient>();
+    std::unique_ptr<CameraProxy> proxy = std::make_unique<CameraProxy>(client);
+};
+
 } // namespace
 
 TEST_F(CameraSynchronizerTest, WindowsOfAPassFollowTheLastSyncTime)
 {
-    QVariantMap channel = record("yard-c1");
-    channel.insert("MultiChannelID", "1");
-    QVariantMap cameras{{"yard-c1", channel}};
+    QVariantMap cameras;
     for (const char* name : {"fresh", "behind", "far", "recent", "future"}) {
         cameras.insert(name, record(name));
     }
@@ -110,18 +136,9 @@ TEST_F(CameraSynchronizerTest, WindowsOfAPassFollowTheLastSyncTime)
     // "count first-start..last-end" against the present; at most an hour's worth per pass.
     QStringList spans;
     for (const char* camera : {"fresh", "behind", "far", "recent", "future"}) {
-        const Windows w = proxy->windows(camera);
-        spans << (w.isEmpty()
-                      ? u"0"_s
-                      : u"%1 %2..%3"_s.arg(w.size()).arg(w.first().first - T).arg(w.last().second - T));
+        spans << proxy->span(camera);
     }
     EXPECT_EQ(spans, (QStringList{"1 -240..-180", "7 -600..-180", "60 -7200..-3600", "0", "0"}));
-    EXPECT_EQ(
-        QJsonDocument(QJsonObject::fromVariantMap(proxy->requests.last())).toJson(QJsonDocument::Compact),
-        R"({"accessToken":"","cameraID":"yard-c1","endTimestamp":1699999820,"ip":"127.0.0.1",)"
-        R"("multiChannelID":"1","password":"6162","port":8000,"startTimestamp":1699999760,)"
-        R"("useSSL":false,"username":"admin"})");
-    EXPECT_FALSE(proxy->requests.first().contains("multiChannelID"));
 }
 
 TEST_F(CameraSynchronizerTest, LastSyncNeverMovesBackAndCamerasThatLeftAreIgnored)
@@ -156,7 +173,7 @@ TEST_F(CameraSynchronizerTest, LastSyncNeverMovesBackAndCamerasThatLeftAreIgnore
     }
     sync->setEnableDelvix({{"enable", true}});
     sync->synchronize();
-    EXPECT_EQ(proxy->windows("a"), (Windows{{T - 240, T - 180}}));
+    EXPECT_EQ(proxy->span("a"), "1 -240..-180");
 }
 
 TEST_F(CameraSynchronizerTest, ProtectedCamerasAreAskedForPairTokensAndFetchedWithAccessTokens)
@@ -199,7 +216,7 @@ TEST_F(CameraSynchronizerTest, ClientRequestedWindowIsOneRequestOnTheOwnerThread
     std::thread([&] { sync->retrieveDelvixData("yard-c0", T - 9000, T - 100); }).join();
     EXPECT_TRUE(proxy->requests.isEmpty()); // not on the host's thread
     QCoreApplication::processEvents();
-    ASSERT_EQ(proxy->windows("yard-c0"), (Windows{{T - 9000, T - 100}}));
+    EXPECT_EQ(proxy->span("yard-c0"), "1 -9000..-100");
     EXPECT_EQ(proxy->requests.size(), 1);
     EXPECT_EQ(proxy->requests[0].value("multiChannelID").toInt(), 0);
 
@@ -232,7 +249,7 @@ TEST_F(CameraSynchronizerTest, SettingsFiles)
         EXPECT_EQ(u"%1 %2"_s.arg(p).arg(d), QString::fromUtf8(expected)) << period << " " << delay;
         EXPECT_EQ(sync->timerIntervalMs(), p * 1000);
         sync->synchronize();
-        EXPECT_EQ(proxy->windows("a"), (Windows{{T - d - p, T - d}})) << period << " " << delay;
+        EXPECT_EQ(proxy->span("a"), u"1 %1..%2"_s.arg(-d - p).arg(-d)) << period << " " << delay;
     }
 }
 
@@ -293,17 +310,12 @@ TEST_F(CameraSynchronizerTest, PluginWiresTheDirectoryTheSynchronizerAndTheColle
 // and the synchroniser on this thread's event loop.
 TEST_F(CameraSynchronizerTest, EndToEndEveryHealthyCameraIsFetchedWhateverTheOthersDo)
 {
-    QList<CameraSetup> setups;
-    for (const char* name : {"door", "vault", "yard", "broken", "sluggish"}) {
-        setups << CameraSetup{};
-        setups.last().name = name;
-        setups.last().password = "pa:ss";
-        setups.last().objectsPerMinute = 20;
-    }
-    setups[1].protectedMetadata = true;
-    setups[1].useSSL = true;
-    setups[2].channels = 2;
-    setups[2].digestAuth = true;
+    // name, port, user, password, protected, channels, SSL, digest, objects per minute
+    const QList<CameraSetup> setups{{"door", 0, "admin", "pa:ss", false, 1, false, false, 20},
+                                    {"vault", 0, "admin", "pa:ss", true, 1, true, false, 20},
+                                    {"yard", 0, "admin", "pa:ss", false, 2, false, true, 20},
+                                    {"broken", 0, "admin", "pa:ss", false, 1, false, false, 20},
+                                    {"sluggish", 0, "admin", "pa:ss", false, 1, false, false, 20}};
     CameraSimulator cameras;
     ASSERT_TRUE(cameras.start(setups));
     cameras.setFailing("broken", true);
@@ -343,9 +355,113 @@ TEST_F(CameraSynchronizerTest, EndToEndEveryHealthyCameraIsFetchedWhateverTheOth
     EXPECT_EQ(sync.getLastSyncMap().keys(), answered); // neither the failing nor the slow camera
 
     // The protected camera was asked on the token path and let the request in.
-    bool vaultByToken = false;
-    for (const ServedRequest& served : cameras.servedRequests()) {
-        vaultByToken |= served.camera == "vault" && served.status == 200 && served.withAccessToken;
+    const QList<ServedRequest> served = cameras.servedRequests();
+    EXPECT_TRUE(std::any_of(served.begin(), served.end(), [](const ServedRequest& r) {
+        return r.camera == "vault" && r.status == 200 && r.withAccessToken;
+    }));
+}
+
+TEST_F(CameraProxyTest, ComposedPathsAndCredentials)
+{
+    const QString query = QStringLiteral("StartTime=100&EndTime=160&Info=127");
+    const QString plain = "admin:admin@127.0.0.1:8080 /VCA/";
+    const std::vector<std::pair<QVariantMap, QString>> rows{
+        {{{"multiChannelID", 1}}, plain + "c1/Data/DB/ObjectMeta?" + query},
+        {{{"accessToken", "AbZ09-_x"}, {"multiChannelID", "0"}, {"useSSL", true}},
+         "admin:admin@127.0.0.1:8080 ssl /VCA/c0/Data/DB/ObjMeta?accessToken=AbZ09-_x&" + query},
+        // Characters that mean something in a query cannot leak out of the token.
+        {{{"accessToken", "a+b/c=&StartTime=0 %"}},
+         plain + "Data/DB/ObjMeta?accessToken=a%2Bb%2Fc%3D%26StartTime%3D0%20%25&" + query},
+        // Hexadecimal Latin-1 password: non-hex characters are skipped, bytes above 127 survive.
+        {{{"password", "61:64-6dzE9"}},
+         QString::fromLatin1("admin:adm\xe9@127.0.0.1:8080 /VCA/Data/DB/ObjectMeta?") + query},
+    };
+    for (const auto& [extra, expected] : rows) {
+        const QString path = send(QString::number(client->calls.size()), 100, 160, true, extra);
+        EXPECT_EQ(client->calls.last().text + u' ' + client->calls.last().path, expected + u' ' + path);
     }
-    EXPECT_TRUE(vaultByToken);
+}
+
+TEST_F(CameraProxyTest, OneRequestInFlightPerCameraCoveredWindowsDroppedFailureEmptiesTheQueue)
+{
+    send("a", 40, 100);
+    send("a", 100, 130); // queued even with an earlier end: the queue is empty
+    send("b", 0, 60);    // another camera goes out at once
+    send("a", 130, 160);
+    send("a", 90, 150);        // ends before the last queued window: dropped
+    send("a", 100, 160);       // equal end: queued
+    send("a", 90, 150, false); // client-requested: never dropped
+    EXPECT_EQ(client->paths(), (QStringList{metaPath(40, 100), metaPath(0, 60)}));
+
+    // Each answer sends the next queued window of that camera, in order.
+    QSignalSpy answers(proxy.get(), &CameraProxy::receiveObjectMeta);
+    for (int i : {0, 2, 3, 4}) {
+        client->complete(i, QNetworkReply::NoError, "{}");
+    }
+    EXPECT_EQ(client->paths().mid(2),
+              (QStringList{metaPath(100, 130), metaPath(130, 160), metaPath(100, 160), metaPath(90, 150)}));
+    EXPECT_EQ(answers.size(), 4);
+
+    // A failure empties only that camera's queue; the camera is idle again.
+    send("a", 200, 260);
+    send("a", 260, 320);
+    send("b", 60, 120);
+    client->complete(5, QNetworkReply::ConnectionRefusedError, QByteArray());
+    EXPECT_EQ(client->calls.size(), 6);
+    client->complete(1, QNetworkReply::NoError, "{}"); // b goes on
+    send("a", 320, 380);
+    EXPECT_EQ(client->paths().mid(6), (QStringList{metaPath(60, 120), metaPath(320, 380)}));
+}
+
+TEST_F(CameraProxyTest, AnswersCountObjectsAndUnusableAnswersFail)
+{
+    QSignalSpy answers(proxy.get(), &CameraProxy::receiveObjectMeta);
+    QSignalSpy failed(proxy.get(), &CameraProxy::requestFailed);
+    const std::tuple<QNetworkReply::NetworkError, QByteArray, int> rows[] = {
+        // count -1: failed
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\": []}", 0},
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\":[{},{},{}]}", 3},
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\":{\"ID\":1}}", 0},
+        {QNetworkReply::NoError, "{\"ObjectMetaInfo\": [", -1},
+        {QNetworkReply::ContentAccessDenied, "{}", -1}};
+    for (const auto& [error, body, count] : rows) {
+        const int i = client->calls.size();
+        send(QString::number(i), 100, 160 + i);
+        client->complete(i, error, body);
+        // The request's own end, and the answer with its number of objects.
+        EXPECT_EQ(count < 0 ? failed.last() : answers.last(),
+                  count < 0 ? QList<QVariant>{QString::number(i)}
+                            : (QList<QVariant>{QString::number(i), 160u + unsigned(i),
+                                               QVariantMap{{"count", count}, {"data", body}}}))
+            << body.constData();
+    }
+    EXPECT_EQ(answers.size() * 10 + failed.size(), 32);
+}
+
+TEST_F(CameraProxyTest, PairTokenExchangeBypassesTheQueue)
+{
+    const QVariantMap record{{"Name", "vault"},     {"IP", "10.0.0.5"},   {"Port", "8443"},
+                             {"User", "op"},        {"Password", "7077"}, {"UseSSL", true},
+                             {"MultiChannelID", 3}, {"Location", "Loc4"}};
+    QSignalSpy tokens(proxy.get(), &CameraProxy::receivePairToken);
+    send("vault", 0, 60);
+    send("vault", 60, 120);
+    proxy->sendPairTokenRequest(record); // goes out although a metadata request is outstanding
+    ASSERT_EQ(client->calls.size(), 2);
+    EXPECT_EQ(client->calls.last().text,
+              "op:pw@10.0.0.5:8443 ssl /VCA/Secure/Token?method=GET&resource=/Data/DB/ObjMeta&client=NOVIR2");
+    client->complete(1, QNetworkReply::NoError, QString::fromUtf8("tok\xc3\xa9n").toUtf8());
+    client->complete(0, QNetworkReply::NoError, "{}"); // the token answer did not advance the queue
+    proxy->sendPairTokenRequest(record);
+    client->complete(3, QNetworkReply::ConnectionRefusedError, QByteArray());
+    EXPECT_EQ(tokens, (QList<QList<QVariant>>{{"vault", QString::fromUtf8("tok\xc3\xa9n")}}));
+    EXPECT_EQ(client->paths().value(2), metaPath(60, 120));
+
+    // Completions after the proxy is gone touch nothing.
+    send("vault", 120, 180);
+    proxy->sendPairTokenRequest(record);
+    proxy.reset();
+    client->complete(2, QNetworkReply::NoError, "{}");
+    client->complete(4, QNetworkReply::NoError, "token");
+    EXPECT_EQ(client->calls.size(), 5);
 }

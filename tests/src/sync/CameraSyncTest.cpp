@@ -123,10 +123,9 @@ TEST_F(CameraSynchronizerTest, WindowsOfAPassFollowTheLastSyncTime)
         cameras.insert(name, record(name));
     }
     make().updateInformation(cameras);
-    sync->updateLastSync({{"behind", uint(T - 600)},
-                          {"far", uint(T - 7200)},
-                          {"recent", uint(T - 180)},
-                          {"future", uint(T + 500)}});
+    QVariantMap lastSync{{"behind", uint(T - 600)}, {"far", uint(T - 7200)}, {"recent", uint(T - 180)}};
+    lastSync.insert("future", uint(T + 500));
+    sync->updateLastSync(lastSync);
     sync->synchronize();
     // "count first-start..last-end" against the present; at most an hour's worth per pass.
     QStringList spans;
@@ -142,15 +141,12 @@ TEST_F(CameraSynchronizerTest, LastSyncNeverMovesBackAndCamerasThatLeftAreIgnore
     QSignalSpy forwarded(sync.get(), &CameraSynchronizer::receiveResponseData);
     const QVariantMap data{{"data", QByteArray("{}")}, {"count", 2}};
     QList<uint> seen;
-    for (uint end : {500u, 400u, 0u, 7u, 0xF0000000u}) { // older windows still forwarded; compared unsigned
-        if (end == 0) {
-            sync->updateLastSync({{"a", 0u}});
-            continue;
-        }
-        sync->receiveObjectMeta("a", end, data);
+    // 0: set back by hand; older windows are still forwarded; times compare unsigned.
+    for (uint end : {500u, 400u, 0u, 7u, 0xF0000000u}) {
+        end ? sync->receiveObjectMeta("a", end, data) : sync->updateLastSync({{"a", 0u}});
         seen << sync->getLastSyncMap().value("a").toUInt();
     }
-    EXPECT_EQ(seen, (QList<uint>{500u, 500u, 7u, 0xF0000000u}));
+    EXPECT_EQ(seen, (QList<uint>{500u, 500u, 0u, 7u, 0xF0000000u}));
     EXPECT_EQ(forwarded[1], (QList<QVariant>{record("a"), 400u, data}));
     sync->receiveObjectMeta("gone", 900, data);
     EXPECT_EQ(forwarded.size(), 4); // a camera that left: neither forwarded nor kept

@@ -245,6 +245,9 @@ TEST_F(CollectorTest, WriteDataSendsTheObjectsWithIdRangeFilteredThumbnailsAndSa
     const QString rows[][2] = {
         {uR"({"ObjectMetaInfo":[{"ID":1, "P":"京A<b>&%1"}]})"_s,
          uR"({"ObjectMetaInfo":[{"ID":1,"P":"京A&lt;b&gt;&amp;%1"}]})"_s},
+        // Markup alone: nothing else would make the text longer.
+        {uR"({"ObjectMetaInfo":[{"ID":1,"P":"<x>"}]})"_s,
+         uR"({"ObjectMetaInfo":[{"ID":1,"P":"&lt;x&gt;"}]})"_s},
         {u"{\"ObjectMetaInfo\":[{\"ID\":1,\"N\":\"a\uFFFFb\uFFFE\"}]}"_s,
          uR"({"ObjectMetaInfo":[{"ID":1,"N":"a\uffffb\ufffe"}]})"_s},
         {uR"({"ObjectMetaInfo":[{"ID":10000000000}]})"_s, uR"({"ObjectMetaInfo":[{"ID":10000000000}]})"_s},

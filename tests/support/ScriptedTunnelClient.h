@@ -5,8 +5,6 @@
 
 #include "INovirTunnelClient.h"
 
-#include <QJsonDocument>
-#include <QJsonObject>
 #include <QList>
 #include <QString>
 #include <functional>
@@ -123,7 +121,7 @@ private:
     }
 };
 
-// Answers in the configuration server's formats, and a record as compact JSON.
+// Answers in the configuration server's formats.
 inline QString nodeInfo(const QStringList& names)
 {
     QString cameras;
@@ -141,8 +139,4 @@ inline QString locRecs(const QString& alias, const QString& location, int group 
                "</Loc></LocList></LocRecs>")
         .arg(live, alias, location)
         .arg(group);
-}
-inline QString jsonText(const QVariantMap& map)
-{
-    return QString::fromUtf8(QJsonDocument(QJsonObject::fromVariantMap(map)).toJson(QJsonDocument::Compact));
 }

@@ -7,13 +7,16 @@
 
 namespace {
 
+struct Behaviour
+{
+    int checkResult = 0;
+    int nextModuleId = 7; // not 1, so tests see that the facility uses what it was given
+    bool nullRegister = false, nullCheck = false, nullWrite = false;
+};
+
 std::mutex g_mutex; // guards everything below
 FakeWemloState g_state;
-int g_checkResult = 0;
-int g_nextModuleId = 7; // not 1, so tests see that the facility uses what it was given
-bool g_nullRegister = false;
-bool g_nullCheck = false;
-bool g_nullWrite = false;
+Behaviour g_behaviour;
 thread_local FakeWemloLine t_pending;
 int g_context = 0;
 WemloLogObject g_object{};
@@ -23,7 +26,7 @@ int registerOp(void*, int kind, const char* name, int* idOut)
     std::lock_guard<std::mutex> lock(g_mutex);
     g_state.registeredModules.emplace_back(name ? name : "");
     g_state.registerKinds.push_back(kind);
-    *idOut = g_nextModuleId++;
+    *idOut = g_behaviour.nextModuleId++;
     return 0;
 }
 
@@ -32,7 +35,7 @@ int checkOp(void*, int selector, int, const char* path, int line)
     std::lock_guard<std::mutex> lock(g_mutex);
     ++g_state.checkCalls;
     t_pending = FakeWemloLine{selector, path ? path : "", line, {}};
-    return g_checkResult;
+    return g_behaviour.checkResult;
 }
 
 void writeOp(void*, const char* format, va_list args)
@@ -41,9 +44,8 @@ void writeOp(void*, const char* format, va_list args)
     std::vsnprintf(buffer, sizeof buffer, format, args);
     std::lock_guard<std::mutex> lock(g_mutex);
     ++g_state.writeCalls;
-    FakeWemloLine line = t_pending;
-    line.text = buffer;
-    g_state.lines.push_back(line);
+    g_state.lines.push_back(t_pending);
+    g_state.lines.back().text = buffer;
 }
 
 } // namespace
@@ -52,9 +54,7 @@ void fakeWemloReset()
 {
     std::lock_guard<std::mutex> lock(g_mutex);
     g_state = FakeWemloState{};
-    g_checkResult = 0;
-    g_nextModuleId = 7;
-    g_nullRegister = g_nullCheck = g_nullWrite = false;
+    g_behaviour = Behaviour{};
 }
 
 FakeWemloState fakeWemloState()
@@ -66,15 +66,14 @@ FakeWemloState fakeWemloState()
 void fakeWemloSetCheckResult(int result)
 {
     std::lock_guard<std::mutex> lock(g_mutex);
-    g_checkResult = result;
+    g_behaviour.checkResult = result;
 }
 
 void fakeWemloSetNullOperations(bool nullRegister, bool nullCheck, bool nullWrite)
 {
     std::lock_guard<std::mutex> lock(g_mutex);
-    g_nullRegister = nullRegister;
-    g_nullCheck = nullCheck;
-    g_nullWrite = nullWrite;
+    g_behaviour =
+        Behaviour{g_behaviour.checkResult, g_behaviour.nextModuleId, nullRegister, nullCheck, nullWrite};
 }
 
 extern "C" WEMLO_EXPORT int LogTrace_GetGlobalObject(int, WemloLogObject** logObjectOut)
@@ -82,9 +81,9 @@ extern "C" WEMLO_EXPORT int LogTrace_GetGlobalObject(int, WemloLogObject** logOb
     std::lock_guard<std::mutex> lock(g_mutex);
     g_object = WemloLogObject{};
     g_object.context = &g_context;
-    g_object.registerModule = g_nullRegister ? nullptr : registerOp;
-    g_object.check = g_nullCheck ? nullptr : checkOp;
-    g_object.write = g_nullWrite ? nullptr : writeOp;
+    g_object.registerModule = g_behaviour.nullRegister ? nullptr : registerOp;
+    g_object.check = g_behaviour.nullCheck ? nullptr : checkOp;
+    g_object.write = g_behaviour.nullWrite ? nullptr : writeOp;
     *logObjectOut = &g_object;
     return 0;
 }

@@ -53,7 +53,6 @@ public:
         m_settings = settings;
     }
     QString getCameraNodeID(const QString& location) override { return cameras.value(location); }
-
     QList<Write> writes() const
     {
         QMutexLocker lock(&m_mutex);
@@ -69,8 +68,8 @@ public:
 
 private:
     mutable QMutex m_mutex;
-    QList<Write> m_writes;    // guarded by m_mutex
-    QVariantMap m_settings;   // guarded by m_mutex
+    QList<Write> m_writes;  // guarded by m_mutex
+    QVariantMap m_settings; // guarded by m_mutex
 };
 
 // An HTTP client that only records calls; the test decides when and how each one completes.
@@ -80,37 +79,26 @@ class RecordingHttpClient : public IBraskHTTPClient
 public:
     struct Call
     {
-        QString host;
         QString path;
-        quint16 port = 0;
-        bool useSSL = false;
-        QString user;
-        QString password;
-        Completion completion;
-        unsigned int timeoutMs = 0;
-        bool completed = false;
+        QString text;          // "user:password@host:port[ ssl] path"
+        Completion completion; // empty once completed
     };
-
     bool Get(const QString& host, const QString& path, quint16 port, bool useSSL, const QString& user,
-             const QString& password, Completion completion, unsigned int timeoutMs,
-             const QList<QString>&) override
+             const QString& password, Completion completion, unsigned int, const QList<QString>&) override
     {
-        calls.append(Call{host, path, port, useSSL, user, password, std::move(completion), timeoutMs, false});
+        const QString ssl = useSSL ? QStringLiteral(" ssl") : QString();
+        calls.append({path,
+                      QStringLiteral("%1:%2@%3:%4%5 %6").arg(user, password, host).arg(port).arg(ssl, path),
+                      std::move(completion)});
         return true;
     }
-
     // Completes call `index`, once.
     void complete(int index, QNetworkReply::NetworkError error, const QByteArray& body)
     {
-        Call& call = calls[index];
-        if (call.completed) {
-            return;
+        if (Completion completion = std::exchange(calls[index].completion, nullptr)) {
+            completion(error, QByteArray(), body, false);
         }
-        call.completed = true;
-        Completion completion = call.completion;
-        completion(error, QByteArray(), body, false);
     }
-
     QStringList paths() const
     {
         QStringList result;

@@ -13,10 +13,11 @@ class ScriptedTunnelClient : public INovirTunnelClient
 {
 public:
     using ServerType = NSNovirTunnelClient::ServerType;
+    static constexpr ServerType Config = NSNovirTunnelClient::ConfigServer;
     struct Request
     {
         void* clientID = nullptr;
-        ServerType type = NSNovirTunnelClient::ConfigServer;
+        ServerType type = Config;
         QString cmdName;
         NSNovirTunnelClient::RequestInfo info;
         QString serverId;
@@ -34,7 +35,7 @@ public:
     char account = 0;
     char servers[2] = {};
 
-    Qt::HANDLE handleOf(ServerType type) { return &servers[type == NSNovirTunnelClient::LocationServer]; }
+    Qt::HANDLE handleOf(ServerType type) { return &servers[type != Config]; }
     void connectServer(ServerType type, bool connected = true)
     {
         for (const auto& handler : QList(connectHandlers)) {
@@ -59,8 +60,7 @@ public:
     {
         for (const auto& [registered, handler] : QList(broadcastHandlers)) {
             if (registered == name) {
-                handler(handleOf(NSNovirTunnelClient::ConfigServer), name, NSNovirTunnelClient::ConfigServer,
-                        relayPath, message);
+                handler(handleOf(Config), name, Config, relayPath, message);
             }
         }
     }
@@ -68,15 +68,14 @@ public:
     void statusEvent(const QString& sourceId, const QString& relayPath, const QString& message)
     {
         requests.at(lastRequest(QStringLiteral("SubCamStatus")))
-            .eventHandler(handleOf(NSNovirTunnelClient::ConfigServer), sourceId, QStringLiteral("CamStatus"),
-                          NSNovirTunnelClient::ConfigServer, relayPath, message);
+            .eventHandler(handleOf(Config), sourceId, QStringLiteral("CamStatus"), Config, relayPath,
+                          message);
     }
 
     void* getServerAccountID() override { return &account; }
     QVariant getServerInfo(Qt::HANDLE clientID, int infoKind) override
     {
-        return clientID == handleOf(NSNovirTunnelClient::ConfigServer) && infoKind == 3 ? QVariant(serverId)
-                                                                                        : QVariant();
+        return clientID == handleOf(Config) && infoKind == 3 ? QVariant(serverId) : QVariant();
     }
     bool isServerConnected(ServerType) override { return true; }
     bool insertRequest(const QString&, void* clientID, ServerType type, const QString& cmdName,
@@ -97,7 +96,7 @@ public:
     {
         connectHandlers.append(handler);
         if (connectOnRegister) {
-            handler(handleOf(NSNovirTunnelClient::ConfigServer), NSNovirTunnelClient::ConfigServer, true);
+            handler(handleOf(Config), Config, true);
             handler(handleOf(NSNovirTunnelClient::LocationServer), NSNovirTunnelClient::LocationServer, true);
         }
     }
@@ -121,3 +120,23 @@ private:
         return true;
     }
 };
+
+// Answers in the configuration server's formats.
+inline QString nodeInfo(const QStringList& names)
+{
+    QString cameras;
+    for (const QString& name : names) {
+        cameras += QStringLiteral("<Cam><Name>%1</Name><ObjectMetaRecordCap>true</ObjectMetaRecordCap></Cam>")
+                       .arg(name);
+    }
+    return QStringLiteral("<NodeInfo><Cameras>%1</Cameras></NodeInfo>").arg(cameras);
+}
+inline QString locRecs(const QString& alias, const QString& location, int group = 1,
+                       const QString& live = "true")
+{
+    return QStringLiteral(
+               "<LocRecs><LocList><Live>%1</Live><Loc><Alias>%2</Alias><Name>%3</Name><GrpID>%4</GrpID>"
+               "</Loc></LocList></LocRecs>")
+        .arg(live, alias, location)
+        .arg(group);
+}

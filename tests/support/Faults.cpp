@@ -77,15 +77,14 @@ std::string enterPrivateMountNamespace()
 {
     if (::unshare(CLONE_NEWNS) != 0) {
         const int rootError = errno;
-        const uid_t uid = ::getuid();
-        const gid_t gid = ::getgid();
+        const std::string uid = std::to_string(::getuid()), gid = std::to_string(::getgid());
         if (::unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) {
             return std::string("no mount namespace: unshare(CLONE_NEWNS): ") + std::strerror(rootError) +
                    ", with a user namespace: " + std::strerror(errno);
         }
         writeProcFile("/proc/self/setgroups", "deny");
-        if (!writeProcFile("/proc/self/uid_map", "0 " + std::to_string(uid) + " 1") ||
-            !writeProcFile("/proc/self/gid_map", "0 " + std::to_string(gid) + " 1")) {
+        if (!writeProcFile("/proc/self/uid_map", "0 " + uid + " 1") ||
+            !writeProcFile("/proc/self/gid_map", "0 " + gid + " 1")) {
             return "cannot map the user into the new user namespace";
         }
     }

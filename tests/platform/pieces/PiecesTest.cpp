@@ -326,7 +326,7 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
     QFile config(data.filePath(u"host.json"_s));
     ASSERT_TRUE(config.open(QIODevice::WriteOnly) && config.write(R"({"remoteServers": ["", "east"]})") > 0);
     config.close();
-    std::atomic<int> answers{0}, stored{0}; // outlive the host, whose plug-ins answer on threads of their own
+    std::atomic<int> answers{0}; // outlives the host, whose plug-ins answer on threads of their own
     PluginHost host(data.path());
 
     const QString serverInfo = u"3CE573D25E0F455B8F75EDDC573E2B64"_s,
@@ -344,15 +344,14 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
     EXPECT_EQ(host.remoteBookmarkPlugin(QString()), nullptr); // an empty name names no server
     ASSERT_NE(host.remoteBookmarkPlugin(u"east"_s), nullptr);
     const auto answer = [&](bool success, QVariant, QString code, QString, bool final) {
-        stored += success && final && code == u"0"_s ? 1 : 0;
-        ++answers;
+        answers += success && final && code == u"0"_s ? 1 : 100; // 1 per answer that says stored
     };
     const QVariantMap bookmark{{u"CameraID"_s, u"cam-1"_s}};
     IRelaySender* relay = host.GetRelaySender();
     EXPECT_FALSE(relay->RelayRequest(bookmarks, u"AddBookmark"_s, bookmark, false, u"west"_s, answer));
     EXPECT_TRUE(relay->RelayRequest(bookmarks, u"AddBookmark"_s, bookmark, false, u"east"_s, answer));
     ASSERT_TRUE(waitFor([&] { return answers > 0; }));
-    EXPECT_EQ(stored, 1);
+    EXPECT_EQ(answers, 1);
     EXPECT_EQ(host.remoteBookmarkPlugin(u"east"_s)->bookmarks().size(), 1);
     EXPECT_TRUE(host.bookmarkPlugin().bookmarks().isEmpty());
 }

@@ -430,9 +430,8 @@ TEST_F(TamsaStorageFaultTest, ReadOnlyDirectoryServesSearchesAndIngestResumesWhe
     std::filesystem::remove(stores[1] + "/tamsa.db-wal");
     std::filesystem::remove(stores[1] + "/tamsa.db-shm");
     runInChild([&]() {
-        std::string why = enterPrivateMountNamespace();
-        why = why.empty() ? bindReadOnly(mountPoint) : why;
-        if (!why.empty()) {
+        if (std::string why = enterPrivateMountNamespace();
+            !why.empty() || !(why = bindReadOnly(mountPoint)).empty()) {
             return why;
         }
         Ids stored(30);

@@ -45,11 +45,10 @@ struct QueryOptions
 {
     uint32_t start = 0, end = 0xFFFFFFFFu;
     std::vector<uint32_t> locations{1};
-    bool nullLocations = false;
     std::string type, primary, other, trace, feature, faceFeature, plate;
     uint32_t duration = 0;
     int32_t direction = 0;
-    bool loitering = false, descending = false, doNotSort = false;
+    bool nullLocations = false, loitering = false, descending = false, doNotSort = false;
 };
 
 struct ResultCopy

@@ -151,11 +151,6 @@ struct Calls
     }
 };
 
-QString nested(int depth)
-{
-    return u"<a>"_s.repeated(depth) + u"x"_s + u"</a>"_s.repeated(depth);
-}
-
 // One side of a token exchange, on a clock of the test's.
 struct Side
 {
@@ -222,13 +217,12 @@ TEST_F(HttpCamerasTest, EveryCallEndsOnceOnTheOwnerThreadWithQtsCode)
         ASSERT_TRUE(waitFor([&] { return out->calls > 0; }));
         // An abandoned call has no body; with a wrong password one challenge is answered, the second
         // ends the call.
-        const bool abandoned = slow || row.change == "small limit";
-        const bool hasObjects = row.error == QNetworkReply::NoError && row.change != "malformed";
-        EXPECT_EQ(
-            std::tuple(out->error, out->abandoned, out->accepted,
-                       out->abandoned ? out->body.isEmpty() : !objects(out->body).isEmpty(),
-                       wrongPassword ? m_cameras.servedRequests().size() : 2),
-            std::tuple(row.error, abandoned, row.camera != std::string("none"), abandoned || hasObjects, 2))
+        const bool abandoned = slow || row.change == "small limit", malformed = row.change == "malformed";
+        EXPECT_EQ(std::tuple(out->error, out->abandoned, out->accepted,
+                             out->abandoned ? out->body.isEmpty() : !objects(out->body).isEmpty(),
+                             wrongPassword ? m_cameras.servedRequests().size() : 2),
+                  std::tuple(row.error, abandoned, row.camera != std::string("none"),
+                             abandoned || (row.error == QNetworkReply::NoError && !malformed), 2))
             << row.camera << " " << row.path.toStdString() << " " << row.change;
     }
     for (size_t i = 0; i < outcomes.size(); ++i) {
@@ -272,7 +266,6 @@ TEST_F(HttpCamerasTest, AnswersHoldTheWindowsObjectsTheSameEachTimeWithAThumbnai
     EXPECT_EQ(fetch(client, window(from, to)), body);
     const QJsonArray list = objects(body);
     EXPECT_EQ(list.size(), m_cameras.generator().objectCount(u"hall"_s, from, to, 50));
-    EXPECT_NEAR(list.size(), 150, 3);
     int inMiddleMinute = 0;
     for (int i = 0; i < list.size(); ++i) {
         const qint64 start = list[i]["StartTime"].toInteger();
@@ -451,10 +444,22 @@ TEST(Quellon, ElementsBecomeMapsRepeatedOnesListsAndLeavesTheirText)
         QString(uR"({"R":{"B":{"C":"x","D":"7"},"Data":"<raw & text>","Empty":"","I":["1","2",{"K":"3"}],)"
                 uR"("J":"only","Open":"","P":"%1","Spaces":"  kept  ","Text":"a & b <c> A"}})"_s.arg(plate))
             .toUtf8());
+    // Past 16 names the children are found by hash; repeated names still gather in one list.
+    QString many = u"<R>"_s;
+    QVariantMap expected;
+    for (int i = 0; i < 120; ++i) { // all 40 names once, then the even ones twice more
+        many += i < 40 || i % 2 == 0 ? u"<N%1>%2</N%1>"_s.arg(i % 40).arg(i / 40) : QString();
+        expected[u"N%1"_s.arg(i % 40)] =
+            i % 2 ? QVariant(u"0"_s) : QVariant(QVariantList{u"0"_s, u"1"_s, u"2"_s});
+    }
+    EXPECT_EQ(Quellon().parse(many + u"</R>"_s).toMap().value(u"R"_s), QVariant(expected));
 }
 
 TEST(Quellon, MalformedOrHostileInputIsRefusedAndLimitsHold)
 {
+    const auto nested = [](int depth) {
+        return u"<a>"_s.repeated(depth) + u"x"_s + u"</a>"_s.repeated(depth);
+    };
     QString laughs = u"<?xml version=\"1.0\"?><!DOCTYPE l [<!ENTITY l0 \"ha\">"_s;
     for (int i = 1; i < 10; ++i) {
         laughs += u"<!ENTITY l%1 \"%2\">"_s.arg(i).arg(u"&l%1;"_s.arg(i - 1).repeated(10));
@@ -483,12 +488,10 @@ TEST(Zelto, TokensAreFreshAndAcceptedOnlyWithTheSamePairTokenSecretAndClock)
     EXPECT_TRUE(urlSafe(pairToken) && pairToken != Zelto::GeneratePairToken()) << pairToken;
     Side client(pairToken), camera(pairToken), otherPair(Zelto::GeneratePairToken());
     std::set<std::string> seen;
-    for (int i = 0; i < 20; ++i) {
+    for (int i = 0; i < 20; ++i) { // each token new, and accepted
         const std::string token = client.manager->GetAccessToken();
-        EXPECT_TRUE(urlSafe(token) && camera.accepts(token)) << token;
-        seen.insert(token);
+        EXPECT_TRUE(urlSafe(token) && camera.accepts(token) && seen.insert(token).second) << token;
     }
-    EXPECT_EQ(seen.size(), 20u);
     const std::string token = client.manager->GetAccessToken();
     EXPECT_FALSE(otherPair.accepts(token) || camera.accepts(std::string()) || camera.accepts("not a token"));
     // Changed data bits (not the last character, which may carry only padding bits).

@@ -121,13 +121,11 @@ TEST_F(TamsaMatchingTest, QueriesSelectAndOrderTheRightObjects)
     }
 }
 
-std::string scored(uint64_t id, float score, float faceScore)
-{
-    return QString::asprintf("%llu:%.4f:%.4f ", qulonglong(id), score, faceScore).toStdString();
-}
-
 TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
 {
+    const auto scored = [](uint64_t id, float score, float faceScore) {
+        return QString::asprintf("%llu:%.4f:%.4f ", qulonglong(id), score, faceScore).toStdString();
+    };
     const std::vector<float> identity = randomUnitVector(1), faceIdentity = randomUnitVector(2);
     const std::vector<float> closeBody = noisyCopy(identity, 0.3f, 10),
                              farBody = noisyCopy(identity, 1.0f, 11);

@@ -37,33 +37,21 @@ bool writeProcFile(const char* path, const std::string& text)
 
 void runInChild(const std::function<std::string()>& body)
 {
-    int reasonPipe[2];
-    ASSERT_EQ(::pipe(reasonPipe), 0);
     std::fflush(stdout);
     const pid_t child = ::fork();
     ASSERT_GE(child, 0);
     if (child == 0) {
-        ::close(reasonPipe[0]);
         const std::string skip = body();
-        if (!skip.empty()) {
-            (void)!::write(reasonPipe[1], skip.data(), skip.size());
-        }
+        std::printf("%s%s\n", skip.empty() ? "" : "skipped: ", skip.c_str());
         std::fflush(stdout);
         std::fflush(stderr);
         ::_exit(!skip.empty() ? kChildSkipped : ::testing::Test::HasFailure() ? 1 : 0);
     }
-    ::close(reasonPipe[1]);
-    std::string reason;
-    char buffer[256];
-    for (ssize_t n; (n = ::read(reasonPipe[0], buffer, sizeof buffer)) > 0;) {
-        reason.append(buffer, size_t(n));
-    }
-    ::close(reasonPipe[0]);
     int status = 0;
     ASSERT_EQ(::waitpid(child, &status, 0), child);
     ASSERT_TRUE(WIFEXITED(status)) << "the child ended by signal " << WTERMSIG(status);
     if (WEXITSTATUS(status) == kChildSkipped) {
-        GTEST_SKIP() << reason;
+        GTEST_SKIP() << "the child could not make the fault (its reason is printed above)";
     }
     EXPECT_EQ(WEXITSTATUS(status), 0) << "the child's checks failed (see above)";
 }
@@ -80,24 +68,23 @@ void runDisabledTestInChild(const char* filter, int limitMs)
     if (output.contains("[  SKIPPED ] 1 test")) {
         GTEST_SKIP() << output.constData();
     }
-    EXPECT_EQ(child.exitStatus(), QProcess::NormalExit) << output.constData();
-    EXPECT_EQ(child.exitCode(), 0) << output.constData();
-    EXPECT_TRUE(output.contains("[  PASSED  ] 1 test")) << output.constData();
+    EXPECT_TRUE(child.exitStatus() == QProcess::NormalExit && child.exitCode() == 0 &&
+                output.contains("[  PASSED  ] 1 test"))
+        << output.constData();
 }
 
 std::string enterPrivateMountNamespace()
 {
     if (::unshare(CLONE_NEWNS) != 0) {
         const int rootError = errno;
-        const uid_t uid = ::getuid();
-        const gid_t gid = ::getgid();
+        const std::string uid = std::to_string(::getuid()), gid = std::to_string(::getgid());
         if (::unshare(CLONE_NEWUSER | CLONE_NEWNS) != 0) {
             return std::string("no mount namespace: unshare(CLONE_NEWNS): ") + std::strerror(rootError) +
                    ", with a user namespace: " + std::strerror(errno);
         }
         writeProcFile("/proc/self/setgroups", "deny");
-        if (!writeProcFile("/proc/self/uid_map", "0 " + std::to_string(uid) + " 1") ||
-            !writeProcFile("/proc/self/gid_map", "0 " + std::to_string(gid) + " 1")) {
+        if (!writeProcFile("/proc/self/uid_map", "0 " + uid + " 1") ||
+            !writeProcFile("/proc/self/gid_map", "0 " + gid + " 1")) {
             return "cannot map the user into the new user namespace";
         }
     }

@@ -43,32 +43,28 @@ float plainCosine(const std::vector<float>& a, const std::vector<float>& b)
 
 std::string jsonArray(const std::vector<float>& values)
 {
-    std::string text = "[";
+    std::string text;
     char buffer[32];
     for (float value : values) {
-        text.append(buffer, std::to_chars(buffer, buffer + sizeof buffer, value).ptr) += ',';
+        text +=
+            (text.empty() ? "[" : ",") + std::string(buffer, std::to_chars(buffer, buffer + 32, value).ptr);
     }
-    text.back() = ']';
-    return values.empty() ? "[]" : text;
+    return text.empty() ? "[]" : text + "]";
 }
 
 std::string objectJson(const ObjectSpec& object)
 {
+    std::string trajectory;
+    for (const auto& [x, y] : object.trajectory) {
+        trajectory += (trajectory.empty() ? "" : ",") + ("{\"x\":" + std::to_string(x)) +
+                      ",\"y\":" + std::to_string(y) + "}";
+    }
     std::string text = "{\"ID\":" + std::to_string(object.id) + ",\"ObjectType\":\"" + object.type +
                        "\",\"StartTime\":" + std::to_string(object.start) +
                        ",\"EndTime\":" + std::to_string(object.end) + ",\"Attributes\":" + object.attributes +
-                       ",\"Trajectory\":[";
-    for (const auto& [x, y] : object.trajectory) {
-        text += "{\"x\":" + std::to_string(x) + ",\"y\":" + std::to_string(y) + "},";
-    }
-    if (!object.trajectory.empty()) {
-        text.pop_back();
-    }
-    text += "],\"Thumbnail\":[{\"image\":\"aW1hZ2U" + std::to_string(object.id) + "\"";
-    if (!object.body.empty()) {
-        text += ",\"feature\":" + jsonArray(object.body);
-    }
-    text += "}]";
+                       ",\"Trajectory\":[" + trajectory + "],\"Thumbnail\":[{\"image\":\"aW1hZ2U" +
+                       std::to_string(object.id) + "\"" +
+                       (object.body.empty() ? "" : ",\"feature\":" + jsonArray(object.body)) + "}]";
     if (!object.face.empty()) {
         text += ",\"FaceThumbnail\":[{\"image\":\"ZmFjZQ\",\"feature\":" + jsonArray(object.face) +
                 ",\"face_detection_info\":{\"filtered\":" + (object.faceFiltered ? "1" : "0") + "}}]";
@@ -82,35 +78,24 @@ std::string objectJson(const ObjectSpec& object)
 
 std::string answerJson(const std::vector<ObjectSpec>& objects)
 {
-    std::string text = "{\"ObjectMetaInfo\":[";
+    std::string text;
     for (const ObjectSpec& object : objects) {
-        text += objectJson(object) + ",";
+        text += (text.empty() ? "" : ",") + objectJson(object);
     }
-    if (!objects.empty()) {
-        text.pop_back();
-    }
-    return text + "]}";
-}
-
-ObjectSpec numberedObject(uint64_t id, bool withVectors)
-{
-    ObjectSpec made{id, "Human", uint32_t(1000 + id), uint32_t(1005 + id)};
-    made.attributes =
-        R"({"Gender":)" + std::to_string(id % 2) + R"(,"Tag":"object )" + std::to_string(id) + "\"}";
-    if (withVectors) {
-        made.body = randomUnitVector(uint32_t(id));
-        if (id % 3 == 0) {
-            made.face = randomUnitVector(uint32_t(id + 100000));
-        }
-    }
-    return made;
+    return "{\"ObjectMetaInfo\":[" + text + "]}";
 }
 
 std::vector<ObjectSpec> numberedObjects(uint64_t firstId, size_t count, bool withVectors)
 {
     std::vector<ObjectSpec> objects;
     for (uint64_t id = firstId; id < firstId + count; ++id) {
-        objects.push_back(numberedObject(id, withVectors));
+        ObjectSpec& made =
+            objects.emplace_back(ObjectSpec{id, "Human", uint32_t(1000 + id), uint32_t(1005 + id)});
+        made.attributes =
+            R"({"Gender":)" + std::to_string(id % 2) + R"(,"Tag":"object )" + std::to_string(id) + "\"}";
+        made.body = withVectors ? randomUnitVector(uint32_t(id)) : std::vector<float>();
+        made.face =
+            withVectors && id % 3 == 0 ? randomUnitVector(uint32_t(id + 100000)) : std::vector<float>();
     }
     return objects;
 }
@@ -119,24 +104,17 @@ TTAMSA_OBJECTMETAINFO_QUERY makeQuery(const QueryOptions& options, std::vector<u
 {
     TTAMSA_OBJECTMETAINFO_QUERY query;
     std::memset(&query, 0, sizeof query);
-    query.wSize = sizeof query;
-    query.dwStartTime = options.start;
-    query.dwEndTime = options.end;
     *locationsOut = options.locations;
     locationsOut->push_back(0);
-    query.pdwLocationIds = options.nullLocations ? nullptr : locationsOut->data();
     auto text = [](const std::string& value) { return value.empty() ? nullptr : value.c_str(); };
-    query.pszObjectType = text(options.type);
-    query.pszPrimaryAttributes = text(options.primary);
-    query.pszOtherAttributes = text(options.other);
-    query.pszTrace = text(options.trace);
-    query.dwDuration = options.duration;
-    query.bLoitering = options.loitering;
-    query.bDescending = options.descending;
+    query.wSize = sizeof query, query.dwStartTime = options.start, query.dwEndTime = options.end;
+    query.pdwLocationIds = options.nullLocations ? nullptr : locationsOut->data();
+    query.pszObjectType = text(options.type), query.pszPrimaryAttributes = text(options.primary);
+    query.pszOtherAttributes = text(options.other), query.pszTrace = text(options.trace);
+    query.dwDuration = options.duration, query.bLoitering = options.loitering;
+    query.bDescending = options.descending, query.bDoNotSort = options.doNotSort,
     query.nDirection = options.direction;
-    query.bDoNotSort = options.doNotSort;
-    query.pszFeature = text(options.feature);
-    query.pszFaceFeature = text(options.faceFeature);
+    query.pszFeature = text(options.feature), query.pszFaceFeature = text(options.faceFeature);
     query.pszPlateNumber = text(options.plate);
     return query;
 }
@@ -190,26 +168,6 @@ void StoreFixture::SetUp()
     ASSERT_TRUE(m_dir.isValid());
     m_database = openHandle();
     ASSERT_NE(m_database, nullptr);
-}
-
-void StoreFixture::TearDown()
-{
-    Tamsa_ReleaseDatabase(&m_database);
-}
-
-std::string StoreFixture::storagePath() const
-{
-    return (m_dir.path() + QStringLiteral("/Server")).toStdString();
-}
-
-int32_t StoreFixture::put(uint32_t location, const std::vector<ObjectSpec>& objects)
-{
-    return putText(location, answerJson(objects));
-}
-
-int32_t StoreFixture::putText(uint32_t location, const std::string& json)
-{
-    return Tamsa_PutObjectMetaInfo(m_database, 7, int32_t(location), json.c_str());
 }
 
 } // namespace storetest

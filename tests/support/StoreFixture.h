@@ -39,20 +39,16 @@ std::string objectJson(const ObjectSpec& object);
 std::string answerJson(const std::vector<ObjectSpec>& objects);
 // Objects firstId.. told apart by their id alone: start time, attributes (Gender, Tag) and, with
 // vectors, a body vector of their own and a face vector on every third.
-ObjectSpec numberedObject(uint64_t id, bool withVectors = true);
 std::vector<ObjectSpec> numberedObjects(uint64_t firstId, size_t count, bool withVectors = true);
 
 struct QueryOptions
 {
     uint32_t start = 0, end = 0xFFFFFFFFu;
     std::vector<uint32_t> locations{1};
-    bool nullLocations = false;
-    std::string type, primary, other, trace;
+    std::string type, primary, other, trace, feature, faceFeature, plate;
     uint32_t duration = 0;
-    bool loitering = false, descending = false;
     int32_t direction = 0;
-    bool doNotSort = false;
-    std::string feature, faceFeature, plate;
+    bool nullLocations = false, loitering = false, descending = false, doNotSort = false;
 };
 
 struct ResultCopy
@@ -81,12 +77,18 @@ class StoreFixture : public ::testing::Test
 {
 protected:
     void SetUp() override;
-    void TearDown() override;
+    void TearDown() override { Tamsa_ReleaseDatabase(&m_database); }
 
-    std::string storagePath() const;
+    std::string storagePath() const { return (m_dir.path() + QStringLiteral("/Server")).toStdString(); }
     void* openHandle() const { return openStore(storagePath()); }
-    int32_t put(uint32_t location, const std::vector<ObjectSpec>& objects);
-    int32_t putText(uint32_t location, const std::string& json);
+    int32_t put(uint32_t location, const std::vector<ObjectSpec>& objects)
+    {
+        return putText(location, answerJson(objects));
+    }
+    int32_t putText(uint32_t location, const std::string& json)
+    {
+        return Tamsa_PutObjectMetaInfo(m_database, 7, int32_t(location), json.c_str());
+    }
     std::vector<ResultCopy> search(const QueryOptions& options, int32_t* status = nullptr)
     {
         return searchStore(m_database, options, status);

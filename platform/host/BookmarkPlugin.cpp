@@ -7,6 +7,7 @@
 #include <QJsonObject>
 #include <QSaveFile>
 #include <QUuid>
+#include <unistd.h>
 
 BookmarkPlugin::BookmarkPlugin(const QString& strStoragePath)
     : m_strStoragePath(strStoragePath)
@@ -23,7 +24,8 @@ BookmarkPlugin::~BookmarkPlugin()
     // Requests already queued are still carried out, so a deletion acknowledged to a client
     // before shutdown is not lost with the thread.
     if (m_thread.isRunning()) {
-        QMetaObject::invokeMethod(this, []() {}, Qt::BlockingQueuedConnection);
+        QMetaObject::invokeMethod(
+            this, []() {}, Qt::BlockingQueuedConnection);
     }
     m_thread.quit();
     m_thread.wait();
@@ -53,10 +55,8 @@ void BookmarkPlugin::AddBookmark(const QVariant& request, const RequestSenderInf
     bool bStored = false;
     {
         QMutexLocker lock(&m_mutex);
-        QHash<QString, QVariantMap> next = m_bookmarks;
-        next.insert(id, bookmark);
-        if (save(next)) {
-            m_bookmarks = next;
+        if (append(QJsonObject{{QStringLiteral("add"), QJsonObject::fromVariantMap(bookmark)}})) {
+            m_bookmarks.insert(id, bookmark);
             bStored = true;
         }
     }
@@ -76,13 +76,10 @@ void BookmarkPlugin::DeleteBookmark(const QVariant& request, const RequestSender
     bool bDeleted = false;
     {
         QMutexLocker lock(&m_mutex);
-        if (!id.isEmpty() && m_bookmarks.contains(id)) {
-            QHash<QString, QVariantMap> next = m_bookmarks;
-            next.remove(id);
-            if (save(next)) {
-                m_bookmarks = next;
-                bDeleted = true;
-            }
+        if (!id.isEmpty() && m_bookmarks.contains(id) &&
+            append(QJsonObject{{QStringLiteral("delete"), id}})) {
+            m_bookmarks.remove(id);
+            bDeleted = true;
         }
     }
     answer(hdlrDoRequestCB, bDeleted, QVariant());
@@ -113,25 +110,59 @@ bool BookmarkPlugin::load()
     if (!file.open(QIODevice::ReadOnly)) {
         return false;
     }
-    const QJsonObject root = QJsonDocument::fromJson(file.readAll()).object();
+    const QByteArray text = file.readAll();
+    file.close();
     QMutexLocker lock(&m_mutex);
-    for (auto it = root.begin(); it != root.end(); ++it) {
-        m_bookmarks.insert(it.key(), it.value().toObject().toVariantMap());
+    const QJsonObject whole = QJsonDocument::fromJson(text).object();
+    bool compact = true;
+    if (!whole.isEmpty() && !whole.contains(QStringLiteral("add")) &&
+        !whole.contains(QStringLiteral("delete"))) {
+        for (auto it = whole.begin(); it != whole.end(); ++it) { // the older form
+            m_bookmarks.insert(it.key(), it.value().toObject().toVariantMap());
+        }
+    } else {
+        qsizetype changes = 0;
+        for (const QByteArray& line : text.split('\n')) {
+            // A line torn by a crash reads as nothing; rewriting the journal drops it.
+            const QJsonObject change = QJsonDocument::fromJson(line).object();
+            const QVariantMap added = change.value(QStringLiteral("add")).toObject().toVariantMap();
+            if (const QString id = added.value(QStringLiteral("BookmarkID")).toString(); !id.isEmpty()) {
+                m_bookmarks.insert(id, added);
+            } else {
+                m_bookmarks.remove(change.value(QStringLiteral("delete")).toString());
+            }
+            changes += line.isEmpty() ? 0 : 1;
+        }
+        compact = changes != m_bookmarks.size();
     }
-    return true;
+    return !compact || rewrite();
 }
 
-bool BookmarkPlugin::save(const QHash<QString, QVariantMap>& bookmarks) const
+bool BookmarkPlugin::append(const QJsonObject& change) const
 {
     QDir().mkpath(QFileInfo(m_strStoragePath).absolutePath());
-    QJsonObject root;
-    for (auto it = bookmarks.begin(); it != bookmarks.end(); ++it) {
-        root.insert(it.key(), QJsonObject::fromVariantMap(it.value()));
+    QFile file(m_strStoragePath);
+    if (!file.open(QIODevice::WriteOnly | QIODevice::Append)) {
+        return false;
     }
+    const qint64 before = file.size();
+    const QByteArray line = QJsonDocument(change).toJson(QJsonDocument::Compact) + '\n';
+    if (file.write(line) == line.size() && file.flush() && ::fsync(file.handle()) == 0) {
+        return true;
+    }
+    file.resize(before); // no torn line for the next change to be appended to
+    return false;
+}
+
+bool BookmarkPlugin::rewrite() const
+{
     QSaveFile file(m_strStoragePath);
     if (!file.open(QIODevice::WriteOnly)) {
         return false;
     }
-    file.write(QJsonDocument(root).toJson(QJsonDocument::Indented));
+    for (const QVariantMap& bookmark : m_bookmarks) {
+        const QJsonObject change{{QStringLiteral("add"), QJsonObject::fromVariantMap(bookmark)}};
+        file.write(QJsonDocument(change).toJson(QJsonDocument::Compact) + '\n');
+    }
     return file.commit();
 }

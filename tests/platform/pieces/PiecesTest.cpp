@@ -8,6 +8,7 @@
 // end to end by the camera directory's integration test). The XML converter (tree shape, refusal of
 // malformed or hostile input), access tokens (both sides run the same derivation; foreign, tampered
 // or late tokens are refused) and the log library.
+#include "BookmarkPlugin.h"
 #include "BraskHttpClient.h"
 #include "CameraSimulator.h"
 #include "Faults.h"
@@ -347,6 +348,42 @@ TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
     EXPECT_EQ(answers, 1);
     EXPECT_EQ(host.remoteBookmarkPlugin(u"east"_s)->bookmarks().size(), 1);
     EXPECT_TRUE(host.bookmarkPlugin().bookmarks().isEmpty());
+}
+
+// The journal: adds and deletes survive a restart, a line torn by a crash is dropped, and a file
+// in the older form (every bookmark by id) still loads.
+TEST(BookmarkPlugin, ChangesSurviveARestartATornLineAndTheOlderForm)
+{
+    QTemporaryDir data;
+    const QString path = data.filePath(u"b/bookmarks.json"_s);
+    const auto call = [](BookmarkPlugin& plugin, const char* method, const QVariantMap& request) {
+        QString id;
+        std::atomic<bool> done{false};
+        QMetaObject::invokeMethod(
+            &plugin, method, Q_ARG(QVariant, request), Q_ARG(RequestSenderInfo, {}),
+            Q_ARG(HDLR_DO_REQUEST_CB, [&](bool, QString code, QString, QVariant payload) {
+                id = code + payload.toMap().value(u"BookmarkID"_s).toString();
+                done = true;
+            }));
+        EXPECT_TRUE(waitFor([&] { return done.load(); }));
+        return id;
+    };
+    const auto ids = [&]() { return QStringList(BookmarkPlugin(path).bookmarks().keys()).join(u','); };
+    QString kept;
+    {
+        BookmarkPlugin plugin(path);
+        kept = call(plugin, "AddBookmark", {{u"CameraID"_s, u"cam-1"_s}}).mid(1);
+        const QString gone = call(plugin, "AddBookmark", {{u"CameraID"_s, u"cam-2"_s}}).mid(1);
+        EXPECT_EQ(call(plugin, "DeleteBookmark", {{u"BookmarkID"_s, gone}}), u"0"_s);
+    }
+    QFile file(path);
+    ASSERT_TRUE(file.open(QIODevice::Append) && file.write("{\"add\":{\"BookmarkID\":\"torn\",\"Came") > 0);
+    file.close();
+    EXPECT_EQ(ids(), kept);
+    EXPECT_EQ(ids(), kept); // the rewritten journal reads the same
+    ASSERT_TRUE(file.open(QIODevice::WriteOnly) && file.write("{\"old\": {\"BookmarkID\": \"old\"}}") > 0);
+    file.close();
+    EXPECT_EQ(ids(), u"old"_s);
 }
 
 TEST(NovirSite, SiteFileIsReadAndABadOneLeavesTheSiteAlone)

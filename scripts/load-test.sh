@@ -1,7 +1,8 @@
 #!/usr/bin/env bash
 # The load test at its full size: 32 clients for 60 s on a store of 100,000 objects while the
 # synchroniser pulls from 50 simulated cameras and the database path moves once. Prints the
-# test's report (requests served and per second, peak RSS of the server, faults if any).
+# test's report (requests served and per second, the memory the server kept a quarter, half,
+# three quarters in and at the end, faults if any).
 # Sizes can be changed through the same variables: DELVIX_LOAD_CLIENTS, DELVIX_LOAD_SECONDS,
 # DELVIX_LOAD_OBJECTS, DELVIX_LOAD_CAMERAS. Build directory: DELVIX_LOAD_BUILD_DIR (build-load).
 set -euo pipefail

@@ -310,9 +310,13 @@ std::vector<uint32_t> AttributeQueryWorker::locationNumbers(const QStringList& l
 AttributeQueryWorker::StoreRequest AttributeQueryWorker::readRequest(const QVariantMap& params) const
 {
     StoreRequest request;
-    // Timestamps are unsigned milliseconds; anything beyond the signed range is far beyond
-    // 32-bit seconds anyway and clamps the same way.
-    const auto toSignedMs = [](const QVariant& value) {
+    // Timestamps are milliseconds since the epoch. One before it means its start (read as
+    // unsigned it would turn into the far end of time and find nothing); anything beyond the
+    // signed range is far beyond 32-bit seconds anyway and clamps the same way.
+    const auto toSignedMs = [](const QVariant& value) -> qint64 {
+        if (value.toDouble() < 0) {
+            return 0;
+        }
         const qulonglong ms = value.toULongLong();
         return ms > qulonglong(std::numeric_limits<qint64>::max()) ? std::numeric_limits<qint64>::max()
                                                                    : qint64(ms);

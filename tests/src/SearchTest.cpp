@@ -141,6 +141,8 @@ TEST_F(SearchTest, RequestsFindTheirObjects)
         {"descending", request({{"descending", true}}), {3, 2, 1}},
         {"ms window", request(msWindow), {1}},
         {"end beyond 32 bits", request({{"endTimestamp", (1ull << 32) * 1000 + 5000}}), {1, 2, 3, 9}},
+        {"start before the epoch", request({{"startTimestamp", -1}}), {1, 2, 3}},
+        {"end before the epoch", request({{"endTimestamp", -5000}}), {}},
         {"primary person attribute", request({{"humanInfo", R"({"Gender":1})"}}, {"Loc1", "Loc2"}), {1, 4}},
         {"other person attribute", request({{"humanInfo", R"({"UpperColor":[5]})"}}), {2}},
         {"both kinds must hold", request({{"humanInfo", R"({"Gender":1,"UpperColor":[5]})"}}), {}},

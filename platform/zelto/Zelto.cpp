@@ -47,9 +47,11 @@ public:
         if (m_pairToken.isEmpty()) {
             return false;
         }
-        const QByteArray raw =
-            QByteArray::fromBase64(QByteArray::fromStdString(accessToken), QByteArray::Base64UrlEncoding);
-        if (raw.size() != kStepBytes + kNonceBytes + kMacBytes) {
+        const QByteArray text = QByteArray::fromStdString(accessToken);
+        const QByteArray raw = QByteArray::fromBase64(text, QByteArray::Base64UrlEncoding);
+        // Only the one spelling of the bytes is the token: the decoder ignores the last
+        // character's spare bits and stray characters, so other texts would decode the same.
+        if (raw.size() != kStepBytes + kNonceBytes + kMacBytes || urlSafe(raw) != text) {
             return false;
         }
         const qint64 step = qFromBigEndian<qint64>(raw.constData());

@@ -537,6 +537,10 @@ TEST(Zelto, TokensAreFreshAndAcceptedOnlyWithTheSamePairTokenSecretAndClock)
         tampered[i] = tampered[i] == 'A' ? 'B' : 'A';
         EXPECT_FALSE(camera.accepts(tampered)) << i;
     }
+    // Another spelling of the same bytes (a spare bit of the last character) is not the token.
+    const std::string alphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789-_";
+    EXPECT_FALSE(
+        camera.accepts(token.substr(0, token.size() - 1) + alphabet[alphabet.find(token.back()) ^ 1]));
     EXPECT_EQ(Side(std::string()).manager->GetAccessToken(), std::string()); // no pair token, no token
 
     const int clocks[][3] = {{1, 45, 1}, {1, -25, 1}, {1, 90, 0}, {1, -70, 0}, {0, 5, 1}, {0, 35, 0}};

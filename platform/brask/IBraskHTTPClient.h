@@ -27,8 +27,6 @@ public:
     using Completion = std::function<void(QNetworkReply::NetworkError error, const QByteArray& headers,
                                           const QByteArray& body, bool abandoned)>;
 
-    virtual ~IBraskHTTPClient() = default;
-
     // path holds the path and the query, already percent-encoded where needed. user and password
     // answer a basic or digest challenge (never sent unasked); credentials a host accepted may be
     // reused for it until it challenges again. timeoutMs bounds the whole
@@ -39,4 +37,7 @@ public:
         std::function<void(QNetworkReply::NetworkError, const QByteArray&, const QByteArray&, bool)>
             completion,
         unsigned int timeoutMs, const QList<QString>& list) = 0;
+
+    // After Get: a closed client library calls Get through the first slot of the table.
+    virtual ~IBraskHTTPClient() = default;
 };

@@ -35,6 +35,7 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <cstring>
 #include <dlfcn.h>
 #include <regex>
 #include <set>
@@ -257,6 +258,15 @@ TEST_F(HttpCamerasTest, DestroyingTheClientCancelsRunningAndQueuedCallsAndOtherT
         EXPECT_EQ(std::tuple(outcome->calls, outcome->error, outcome->abandoned),
                   std::tuple(1, QNetworkReply::OperationCanceledError, true));
     }
+}
+
+// A closed client library calls Get through the first slot of the virtual table.
+TEST(BraskHttpClient, GetIsTheFirstVirtualSlot)
+{
+    const auto get = &IBraskHTTPClient::Get;
+    std::uintptr_t slot = 0;
+    std::memcpy(&slot, &get, sizeof slot);
+    EXPECT_EQ(slot, 1u); // the Itanium C++ ABI's pointer to a virtual member: 1 + its byte offset
 }
 
 TEST_F(HttpCamerasTest, AnswersHoldTheWindowsObjectsTheSameEachTimeWithAThumbnail)

@@ -170,8 +170,13 @@ void CameraProxy::handleHttpResponse(const QVariantMap& request, QNetworkReply::
 QVariantMap CameraProxy::composePairTokenRequest(const QVariantMap& cameraRecord) const
 {
     QVariantMap request;
+    // Channel records carry their index as "MultiChannelID", so a channel asks for the camera's token.
+    const QString channel =
+        cameraRecord.contains(QStringLiteral("MultiChannel"))
+            ? QStringLiteral("/c%1").arg(cameraRecord.value(QStringLiteral("MultiChannel")).toInt())
+            : QString();
     request.insert(kPath,
-                   QStringLiteral("/VCA") +
+                   QStringLiteral("/VCA") + channel +
                        QStringLiteral("/Secure/Token?method=GET&resource=/Data/DB/ObjMeta&client=NOVIR2"));
     request.insert(kCameraID, cameraRecord.value(QStringLiteral("Name")).toString());
     request.insert(kIp, cameraRecord.value(QStringLiteral("IP")).toString());

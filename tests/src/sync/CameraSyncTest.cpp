@@ -438,6 +438,8 @@ TEST_F(CameraProxyTest, PairTokenExchangeBypassesTheQueue)
     client->complete(3, QNetworkReply::ConnectionRefusedError, QByteArray());
     EXPECT_EQ(tokens, (QList<QList<QVariant>>{{"vault", QString::fromUtf8("tok\xc3\xa9n")}}));
     EXPECT_EQ(client->paths().value(2), metaPath(60, 120));
+    EXPECT_EQ(proxy->composePairTokenRequest({{"MultiChannel", 2}}).value("path").toString().left(12),
+              "/VCA/c2/Secu");
 
     // Completions after the proxy is gone touch nothing.
     send("vault", 120, 180);

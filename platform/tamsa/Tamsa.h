@@ -37,6 +37,9 @@
 // than the stored 512-float vectors (the first n elements count); longer ones score 0. A query
 // text that does not parse (attributes not an object, trace not a list of >= 2 points, feature
 // not a list of numbers) fails First with TAMSA_E_BAD_QUERY rather than matching everything.
+// A scalar attribute condition matches a stored list that holds the value (objects store colours
+// as lists). A plate condition, in pszPlateNumber or as the "PlateNumber" attribute, needs an
+// object with a plate: a pattern of stars alone matches every plate, not the absence of one.
 
 #include <cstddef>
 #include <cstdint>

@@ -120,15 +120,20 @@ bool insidePolygon(const TrajectoryPoint& p, const std::vector<TrajectoryPoint>&
     return inside;
 }
 
+// An object without a plate matches no pattern but the empty one (Tamsa.h).
+bool platePatternMatches(std::string_view plate, const std::string& pattern)
+{
+    return pattern.empty() || (!plate.empty() && wildcardContains(foldCase(plate), foldCase(pattern)));
+}
+
 bool matchesPlate(const JsonValue& query, std::string_view plate)
 {
     if (query.isString()) {
-        return wildcardContains(foldCase(plate), foldCase(query.text));
+        return platePatternMatches(plate, query.text);
     }
     if (query.isArray()) {
         for (size_t i = 0; i < query.items.size(); ++i) {
-            if (query.items[i].isString() &&
-                wildcardContains(foldCase(plate), foldCase(query.items[i].text))) {
+            if (query.items[i].isString() && platePatternMatches(plate, query.items[i].text)) {
                 return true;
             }
         }

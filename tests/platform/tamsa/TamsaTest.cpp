@@ -98,6 +98,7 @@ TEST_F(TamsaMatchingTest, QueriesSelectAndOrderTheRightObjects)
         {"plate question mark", [](Q& q) { q.plate = "A?C"; }, {3}},
         {"plate from the crop", [](Q& q) { q.plate = "Z 99"; }, {4}},
         {"any plate", [](Q& q) { q.plate = "*"; }, {3, 4}},
+        {"any plate, as an attribute", [](Q& q) { q.primary = R"({"PlateNumber":"**"})"; }, {3, 4}},
         {"plate and type", [](Q& q) { q.primary = R"({"PlateNumber":"bc-1","Type":3})"; }, {3}},
         {"line either way", [&](Q& q) { q.trace = line; }, {1, 2}},
         {"line positive to negative", [&](Q& q) { q.trace = line, q.direction = 2; }, {1}},

@@ -8,6 +8,7 @@
 #include <QStringList>
 #include <QThread>
 
+#include <algorithm>
 #include <ctime>
 #include <mutex>
 #include <vector>
@@ -150,11 +151,13 @@ PlatformHelper::LocalZone PlatformHelper::localZone()
         zone.daylightNow = local.tm_isdst > 0;
     }
 #else
-    // POSIX has no "standard bias" call: take the offset of a moment of this year that is not
-    // in daylight saving time (January or July, whichever hemisphere). localtime_r, unlike
-    // localtime, keeps its result to the caller; tzset makes a changed TZ count, as a changed
-    // Windows zone does. tzset rewrites the C library's zone state, and the re-identification
-    // threads all ask at once: one caller at a time, under a lock every tool can see.
+    // POSIX has no "standard bias" call: standard time is the smaller UTC offset of January and
+    // July of this year and daylight time the larger, whichever hemisphere, and whatever tm_isdst
+    // says (a zone may mark its winter as daylight time with a negative saving, as Europe/Dublin
+    // does; Windows gives that zone a standard bias of 0). localtime_r, unlike localtime, keeps its
+    // result to the caller; tzset makes a changed TZ count, as a changed Windows zone does. tzset
+    // rewrites the C library's zone state, and the re-identification threads all ask at once: one
+    // caller at a time, under a lock every tool can see.
     std::lock_guard<std::mutex> lock(processStateMutex());
     tzset();
     const time_t now = std::time(nullptr);
@@ -162,25 +165,22 @@ PlatformHelper::LocalZone PlatformHelper::localZone()
     if (!localtime_r(&now, &local)) {
         return zone;
     }
-    zone.daylightNow = local.tm_isdst > 0;
-    long standardOffsetSeconds = local.tm_gmtoff;
-    if (zone.daylightNow) {
-        for (int month : {0, 6}) {
-            std::tm probe = {};
-            probe.tm_year = local.tm_year;
-            probe.tm_mon = month;
-            probe.tm_mday = 1;
-            probe.tm_hour = 12;
-            probe.tm_isdst = -1;
-            const time_t probeTime = mktime(&probe);
-            std::tm probeLocal = {};
-            if (probeTime != static_cast<time_t>(-1) && localtime_r(&probeTime, &probeLocal) &&
-                probeLocal.tm_isdst == 0) {
-                standardOffsetSeconds = probeLocal.tm_gmtoff;
-                break;
-            }
+    long offsets[2] = {local.tm_gmtoff, local.tm_gmtoff};
+    for (int half : {0, 1}) {
+        std::tm probe = {};
+        probe.tm_year = local.tm_year;
+        probe.tm_mon = half * 6;
+        probe.tm_mday = 1;
+        probe.tm_hour = 12;
+        probe.tm_isdst = -1;
+        const time_t probeTime = mktime(&probe);
+        std::tm probeLocal = {};
+        if (probeTime != static_cast<time_t>(-1) && localtime_r(&probeTime, &probeLocal)) {
+            offsets[half] = probeLocal.tm_gmtoff;
         }
     }
+    const long standardOffsetSeconds = std::min(offsets[0], offsets[1]);
+    zone.daylightNow = offsets[0] != offsets[1] && local.tm_gmtoff == std::max(offsets[0], offsets[1]);
     zone.standardBiasMinutes = static_cast<int>(-standardOffsetSeconds / 60);
 #endif
     return zone;

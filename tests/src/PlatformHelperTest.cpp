@@ -12,16 +12,18 @@ TEST(PlatformHelper, LocalZoneFollowsTheZoneOfTheMoment)
 {
     const char* previous = std::getenv("TZ");
     const std::string saved = previous ? previous : "";
-    // POSIX zone names count west as positive; "EST5EDT" is five hours west, daylight time or not.
+    // Biases count west as positive. Dublin marks its winter as daylight time (negative saving):
+    // its standard time is still the smaller offset, as on Windows.
     for (const auto& [zone, bias] :
-         {std::pair{"UTC-8", -480}, std::pair{"UTC+3:30", 210}, std::pair{"EST5EDT", 300}}) {
+         {std::pair{"Europe/Dublin", 0}, std::pair{"Europe/Berlin", -60}, std::pair{"America/New_York", 300},
+          std::pair{"Australia/Sydney", -600}, std::pair{"Asia/Kolkata", -330}, std::pair{"UTC", 0}}) {
         ::setenv("TZ", zone, 1);
         const PlatformHelper::LocalZone local = PlatformHelper::localZone();
         const std::time_t now = std::time(nullptr);
         std::tm parts = {};
         ::localtime_r(&now, &parts);
         EXPECT_EQ(std::pair(local.standardBiasMinutes, local.daylightNow),
-                  std::pair(bias, parts.tm_isdst > 0))
+                  std::pair(bias, parts.tm_gmtoff != -bias * 60L))
             << zone;
     }
     previous ? ::setenv("TZ", saved.c_str(), 1) : ::unsetenv("TZ");

@@ -50,7 +50,8 @@ struct Frame
 QVariant closeFrame(Frame& frame)
 {
     if (frame.children.empty()) {
-        return QVariant(std::move(frame.text));
+        // Servers may pretty-print their answers: "<UseSSL> false </UseSSL>" is "false".
+        return QVariant(frame.text.trimmed());
     }
     QVariantMap map;
     for (auto& child : frame.children) {

@@ -485,11 +485,11 @@ TEST(Quellon, ElementsBecomeMapsRepeatedOnesListsAndLeavesTheirText)
         u"<?xml version=\"1.0\"?>\n<R attr=\"ignored\">\n <B><C>x</C><D>7</D></B>\n"
         " <I>1</I><J>only</J><I>2</I><I><K>3</K></I>\n <Empty/><Open></Open>\n"
         " <Text>a &amp; b &lt;c&gt; &#x41;</Text> <!-- comment -->\n"
-        " <Data><![CDATA[<raw & text>]]></Data><Spaces>  kept  </Spaces><P>%1</P>\n</R>\n"_s.arg(plate);
+        " <Data><![CDATA[<raw & text>]]></Data><Spaces>\n  trimmed \t</Spaces><P>%1</P>\n</R>\n"_s.arg(plate);
     EXPECT_EQ(
         QJsonDocument::fromVariant(Quellon().parse(xml)).toJson(QJsonDocument::Compact),
         QString(uR"({"R":{"B":{"C":"x","D":"7"},"Data":"<raw & text>","Empty":"","I":["1","2",{"K":"3"}],)"
-                uR"("J":"only","Open":"","P":"%1","Spaces":"  kept  ","Text":"a & b <c> A"}})"_s.arg(plate))
+                uR"("J":"only","Open":"","P":"%1","Spaces":"trimmed","Text":"a & b <c> A"}})"_s.arg(plate))
             .toUtf8());
     // Past 16 names the children are found by hash; repeated names still gather in one list.
     QString many = u"<R>"_s;

@@ -564,17 +564,20 @@ void sampleMemory(quint16 port, qint64 deadline, std::vector<MemorySample>* samp
 }
 
 // The lowest of each figure in the stretch before `to`: answers in flight come and go, what the
-// server keeps stays in the lowest sample (it hands freed pages back every 2 s).
+// server keeps stays in the lowest sample (it hands freed pages back every 2 s). A stretch the
+// sampler missed (a slow answer) takes the last sample before it.
 std::pair<double, double> keptMb(const std::vector<MemorySample>& samples, qint64 from, qint64 to)
 {
-    double rss = 1e9, heap = 1e9;
+    std::pair<double, double> kept{-1, -1}, last{-1, -1};
     for (const auto& [at, rssMb, heapMb] : samples) {
-        if (at > from && at <= to) {
-            rss = std::min(rss, rssMb);
-            heap = std::min(heap, heapMb);
+        if (at <= from) {
+            last = {rssMb, heapMb};
+        } else if (at <= to) {
+            kept = kept.first < 0 ? std::pair(rssMb, heapMb)
+                                  : std::pair(std::min(kept.first, rssMb), std::min(kept.second, heapMb));
         }
     }
-    return {rss, heap};
+    return kept.first < 0 ? last : kept;
 }
 
 TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)

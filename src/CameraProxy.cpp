@@ -108,10 +108,15 @@ void CameraProxy::get(const QVariantMap& request,
                                                    const QByteArray&, bool))
 {
     std::weak_ptr<CameraProxy*> self = m_self;
+    const quint16 port = portOf(request.value(kPort));
+    if (port == 0) { // the client refuses the call; its network error alone would not say why
+        DELVIX_LOG(LogFacility::LevelError, "%s, camera %s has no usable port: %s", "CameraProxy::get",
+                   qPrintable(request.value(kCameraID).toString()),
+                   qPrintable(request.value(kPort).toString()));
+    }
     m_httpClient->Get(
-        request.value(kIp).toString(), request.value(kPath).toString(), portOf(request.value(kPort)),
-        request.value(kUseSSL).toBool(), request.value(kUsername).toString(),
-        request.value(kPassword).toString(),
+        request.value(kIp).toString(), request.value(kPath).toString(), port, request.value(kUseSSL).toBool(),
+        request.value(kUsername).toString(), request.value(kPassword).toString(),
         [self, request, handler](QNetworkReply::NetworkError error, const QByteArray&, const QByteArray& body,
                                  bool flag) {
             if (const std::shared_ptr<CameraProxy*> proxy = self.lock()) {

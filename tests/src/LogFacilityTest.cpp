@@ -2,7 +2,9 @@
 // scope tracer's pairing, and silence when the library or its operations are missing.
 
 #include "LogFacility.h"
+#include "CameraProxy.h"
 #include "FakeWemlo.h"
+#include "HostFakes.h"
 #include "ScopeTracer.h"
 
 #include <QStringList>
@@ -62,6 +64,13 @@ TEST(LogFacilityTest, WritesThroughTheLastModuleTracesEveryWayOutAndIsSilentWith
                   "2 checks 2 writes 2309:Traced::function, Enter;2309:Traced::function, Leave")
             << path;
     }
+
+    // A camera whose port cannot be used is named with the port before the client refuses the call.
+    EXPECT_NE(written([] {
+                  CameraProxy(std::make_shared<RecordingHttpClient>())
+                      .sendPairTokenRequest({{"Name", "cam9"}, {"IP", "10.0.0.9"}, {"Port", 70000}});
+              }).find("CameraProxy::get, camera cam9 has no usable port: 70000"),
+              std::string::npos);
 
     // A refused check evaluates no argument and writes nothing.
     int evaluations = 0;

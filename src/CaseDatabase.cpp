@@ -415,6 +415,11 @@ bool CaseDatabase::containCase(int caseId)
     return m_shared->caseMap.contains(caseId);
 }
 
+std::unique_lock<std::recursive_mutex> CaseDatabase::lockSequence() const
+{
+    return std::unique_lock<std::recursive_mutex>(m_shared->mutex);
+}
+
 QVariantMap CaseDatabase::getCaseInfoMap(int caseId)
 {
     std::lock_guard<std::recursive_mutex> locker(m_shared->mutex);

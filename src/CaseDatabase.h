@@ -28,6 +28,7 @@
 #include <QString>
 #include <QVariant>
 #include <memory>
+#include <mutex>
 #include <utility>
 
 class QSqlQuery;
@@ -73,6 +74,10 @@ public:
     // Up to three images: at most three from type-0 items, or one from a type-1 item and one
     // from a type-0 item, in start-time order.
     virtual QList<QString> getCaseCoverImage(int caseId);
+
+    // Holds the vault's lock for a command's read-modify-write sequence, so that no other
+    // command's operations fall between its own (the lock is recursive: they still work).
+    std::unique_lock<std::recursive_mutex> lockSequence() const;
 
 private:
     class ConnectionGuard;

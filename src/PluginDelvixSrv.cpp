@@ -486,38 +486,44 @@ void PluginDelvixSrv::commandUpdateCase(const QVariant& params, const RequestSen
     }
     const QVariantMap map = params.toMap();
     const int caseId = map.value(KEY_CASE_ID).toInt();
-    if (!pCaseDatabase->containCase(caseId)) {
-        reply(hdlrDoRequestCB, RC_CASE_NOT_FOUND, QVariant());
-        return;
-    }
-    if (!pCaseDatabase->updateCase(caseId, map)) {
-        reply(hdlrDoRequestCB, RC_FAILURE, QVariant());
-        return;
-    }
-    QSet<int> keptIds;
-    bool bPartialFailure = false;
-    const QList<QVariant> items = map.value(KEY_CASE_ITEM).toList();
-    for (const QVariant& element : items) {
-        const QVariantMap item = element.toMap();
-        const int itemId = item.value(KEY_ID).toInt();
-        if (pCaseDatabase->updateCaseItem(itemId, item)) {
-            keptIds.insert(itemId);
+    QString code = RC_SUCCESS;
+    QList<QVariant> removedItems;
+    QVariantMap updated;
+    {
+        // Another update of this case must not fall between reading its items and deleting those
+        // not listed: each would delete what the other kept.
+        const auto sequence = pCaseDatabase->lockSequence();
+        if (!pCaseDatabase->containCase(caseId)) {
+            code = RC_CASE_NOT_FOUND;
+        } else if (!pCaseDatabase->updateCase(caseId, map)) {
+            code = RC_FAILURE;
         } else {
-            bPartialFailure = true;
+            QSet<int> keptIds;
+            for (const QVariant& element : map.value(KEY_CASE_ITEM).toList()) {
+                const QVariantMap item = element.toMap();
+                const int itemId = item.value(KEY_ID).toInt();
+                if (pCaseDatabase->updateCaseItem(itemId, item)) {
+                    keptIds.insert(itemId);
+                } else {
+                    code = RC_PARTIAL_FAILURE;
+                }
+            }
+            // Every stored item that the request did not keep goes, with its bookmark.
+            QSet<int> removedIds = pCaseDatabase->getCaseItemIdSet(caseId);
+            removedIds.subtract(keptIds);
+            for (const int itemId : std::as_const(removedIds)) {
+                removedItems.append(pCaseDatabase->getCaseItemInfoMap(itemId));
+                pCaseDatabase->deleteCaseItem(itemId);
+            }
+            updated = pCaseDatabase->getCaseInfoMap(caseId);
         }
     }
-    // Every stored item that the request did not keep goes, with its bookmark.
-    QSet<int> removedIds = pCaseDatabase->getCaseItemIdSet(caseId);
-    removedIds.subtract(keptIds);
-    QList<QVariant> removedItems;
-    for (const int itemId : std::as_const(removedIds)) {
-        const QVariantMap item = pCaseDatabase->getCaseItemInfoMap(itemId);
-        pCaseDatabase->deleteCaseItem(itemId);
-        removedItems.append(item);
+    if (code == RC_CASE_NOT_FOUND || code == RC_FAILURE) {
+        reply(hdlrDoRequestCB, code, QVariant());
+        return;
     }
     handleDeleteCaseItemBookmark(removedItems, senderInfo);
-    reply(hdlrDoRequestCB, bPartialFailure ? RC_PARTIAL_FAILURE : RC_SUCCESS,
-          QVariant(pCaseDatabase->getCaseInfoMap(caseId)));
+    reply(hdlrDoRequestCB, code, QVariant(updated));
 }
 
 void PluginDelvixSrv::commandDeleteCase(const QVariant& params, const RequestSenderInfo& senderInfo,
@@ -529,13 +535,21 @@ void PluginDelvixSrv::commandDeleteCase(const QVariant& params, const RequestSen
         return;
     }
     const int caseId = params.toInt();
-    // Read before anything goes: the bookmarks of these items are removed afterwards.
-    const QList<QVariant> items = pCaseDatabase->getCaseItemList(caseId);
-    if (!pCaseDatabase->containCase(caseId)) {
+    QList<QVariant> items;
+    bool bFound = false, bDeleted = false;
+    {
+        // Read before anything goes (the bookmarks of these items are removed afterwards), with
+        // no item added in between.
+        const auto sequence = pCaseDatabase->lockSequence();
+        items = pCaseDatabase->getCaseItemList(caseId);
+        bFound = pCaseDatabase->containCase(caseId);
+        bDeleted = bFound && pCaseDatabase->deleteCase(caseId);
+    }
+    if (!bFound) {
         reply(hdlrDoRequestCB, RC_CASE_NOT_FOUND, QVariant());
         return;
     }
-    if (pCaseDatabase->deleteCase(caseId)) {
+    if (bDeleted) {
         handleDeleteCaseItemBookmark(items, senderInfo);
         reply(hdlrDoRequestCB, RC_SUCCESS, QVariant(caseId));
     } else {

@@ -279,6 +279,39 @@ TEST_F(PluginCasesTest, CaseCommandsGuardTheData)
                 vault().getAllCase().isEmpty());
 }
 
+// Two clients rewrite one case's items at once: the case holds one client's list whole.
+TEST_F(PluginCasesTest, ConcurrentUpdatesOfOneCaseKeepOneListWhole)
+{
+    for (int round = 0; round < 20; ++round) {
+        const int caseId = caseIdOf(call(CMD_ADD_CASE_WITH_RECORDINGS,
+                                         batch("c", {item("a", false), item("b", false), item("c", false)})));
+        QList<int> ids = vault().getCaseItemIdSet(caseId).values();
+        std::sort(ids.begin(), ids.end());
+        std::vector<std::thread> threads;
+        for (const QString client : {"1", "2"}) {
+            threads.emplace_back([&, client] {
+                QVariantList list;
+                for (int i : {0, 1}) {
+                    list << QVariantMap{{KEY_ID, ids[i]}, {KEY_NODE_ID, "n"}, {KEY_COMMENT, client}};
+                }
+                ReplyRecorder recorder;
+                m_plugin->Request(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, caseId}, {KEY_CASE_ITEM, list}},
+                                  m_sender, recorder.callback());
+                recorder.waitFinal();
+            });
+        }
+        for (std::thread& thread : threads) {
+            thread.join();
+        }
+        QStringList comments;
+        for (const QVariant& element : vault().getCaseItemList(caseId)) {
+            comments << element.toMap().value(KEY_COMMENT).toString();
+        }
+        EXPECT_TRUE(comments == QStringList({"1", "1"}) || comments == QStringList({"2", "2"}))
+            << qPrintable(comments.join(','));
+    }
+}
+
 TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
 {
     constexpr int kThreads = 4, kCasesPerThread = 15;

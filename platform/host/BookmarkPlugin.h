@@ -7,7 +7,7 @@
 // kept in a journal file, one JSON line per change ({"add": BOOKMARK} or {"delete": ID}) appended
 // and synced before the change is answered, so they survive a restart and a change costs what it
 // writes, not what is stored. Loading rewrites the journal compactly; it also reads the older
-// form, one JSON object of every bookmark by id. Memory: the bookmarks, about 1.2 KB each.
+// form, one JSON object of every bookmark by id. Memory: the bookmarks, about 1.6 KB each.
 // The answer mode lets tests make the plug-in fail, stay silent or answer twice.
 
 #include "HostCallbacks.h"

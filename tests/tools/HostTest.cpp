@@ -662,7 +662,7 @@ TEST(HostLoad, ManyClientsWhileSynchronisingAndMovingTheDatabase)
         kept[q] = keptMb(memory, at - stretch, at);
     }
     // By design the case map (about 0.9 KB a case) and the recording server's bookmarks (about
-    // 1.2 KB each) grow: 3 KB per acknowledged write covers both. Caches that fill up to a bound
+    // 1.6 KB each) grow: 3 KB per acknowledged write covers both. Caches that fill up to a bound
     // (the databases', the simulated cameras' request log) fit in the margin.
     const double designMb = (shared.acknowledged - acknowledgedWarm) * 3.0 / 1024;
     const double rssGrowth = kept[3].first - kept[0].first, heapGrowth = kept[3].second - kept[0].second;

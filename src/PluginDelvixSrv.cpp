@@ -270,24 +270,39 @@ void PluginDelvixSrv::Request(const QString& strCommand, const QVariant& params,
         {CMD_RETRIEVE_CASE_ITEM_MODEL, &PluginDelvixSrv::commandRetrieveCaseItemModel},
     };
 
+    // Whether the handler sent its final reply, so that one that throws before it still answers.
+    const auto answered = std::make_shared<std::atomic<bool>>(false);
+    const HDLR_DO_REQUEST_CB tracked =
+        hdlrDoRequestCB ? HDLR_DO_REQUEST_CB([answered, hdlrDoRequestCB](bool bFinal, const QString& strCode,
+                                                                         const QString& strMessage,
+                                                                         const QVariant& payload) {
+            if (bFinal) {
+                *answered = true;
+            }
+            hdlrDoRequestCB(bFinal, strCode, strMessage, payload);
+        })
+                        : HDLR_DO_REQUEST_CB();
     try {
         for (const CommandEntry& entry : commandTable) {
             if (strCommand == entry.strCommand) {
-                (this->*entry.handler)(params, senderInfo, hdlrDoRequestCB);
+                (this->*entry.handler)(params, senderInfo, tracked);
                 return;
             }
         }
         if (hdlrDoRequestCB) {
             hdlrDoRequestCB(true, RC_COMMAND_NOT_SUPPORTED, QString(), QVariant());
         }
+        return;
     } catch (const std::exception& e) {
-        // Nothing may escape into the host. The handler may already have answered, so the
-        // failure is only logged.
+        // Nothing may escape into the host; a client not yet answered gets its final "-1".
         DELVIX_LOG(LogFacility::LevelError, "%s, %s failed: %s", "PluginDelvixSrv::Request",
                    qPrintable(strCommand), e.what());
     } catch (...) {
         DELVIX_LOG(LogFacility::LevelError, "%s, %s failed", "PluginDelvixSrv::Request",
                    qPrintable(strCommand));
+    }
+    if (hdlrDoRequestCB && !answered->exchange(true)) {
+        hdlrDoRequestCB(true, RC_FAILURE, QString(), QVariant());
     }
 }
 

@@ -46,6 +46,10 @@ public:
     {
         return !failing.contains(itemId) && CaseDatabase::updateCaseItem(itemId, fields);
     }
+    QVariantList getCaseList() override
+    {
+        return failing.contains(-1) ? throw std::bad_alloc() : CaseDatabase::getCaseList();
+    }
 };
 
 QVariantMap item(const QString& nodeId, bool needBookmark, qint64 start = 1700000000000,
@@ -255,6 +259,8 @@ TEST_F(PluginCasesTest, CaseCommandsGuardTheData)
     std::sort(ids.begin(), ids.end());
     ASSERT_EQ(ids.size(), 3);
     EXPECT_EQ(call(CMD_UPDATE_CASE, QVariantMap{{KEY_CASE_ID, 9999}}).code, RC_CASE_NOT_FOUND);
+    failingOne->failing = {-1}; // a handler that throws still answers, once
+    EXPECT_EQ(summary(send(CMD_GET_CASE_LIST, QVariant())), answered(RC_FAILURE));
     EXPECT_EQ(summary(send(CMD_DELETE_CASE, 9999)), answered(RC_CASE_NOT_FOUND));
 
     // One failing item update: partial failure, and that item goes with the one not listed.

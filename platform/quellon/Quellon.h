@@ -3,9 +3,10 @@
 //
 // Shape: the result is a map holding the root element under its name. An element with child
 // elements becomes a map of its children by name; an element without children becomes its text
-// without the whitespace around it (servers may pretty-print), empty for an empty element. An element name that occurs more than once under the same
-// parent becomes a list of the occurrences, in document order. Attributes, comments, processing
-// instructions and text between child elements are ignored.
+// without the whitespace around it (servers may pretty-print), empty for an empty element. An
+// element name that occurs more than once under the same parent becomes a list of the
+// occurrences, in document order. Attributes, comments, processing instructions and text between
+// child elements are ignored.
 //
 // Failures: malformed or truncated XML, a DOCTYPE (so no entity declarations, internal or
 // external), an undeclared entity, nesting deeper than kMaxDepth, more than kMaxElements

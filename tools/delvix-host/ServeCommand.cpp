@@ -19,7 +19,6 @@
 namespace {
 
 int g_signalPipe[2] = {-1, -1};
-[[maybe_unused]] constexpr int kTrimIntervalMs = 2000;
 
 void onTerminate(int)
 {
@@ -107,10 +106,10 @@ int runServe(QStringList args)
     // come and go between long-lived blocks (the case map, the databases' caches), so the holes
     // they leave stay resident, and a server that runs for months would ratchet up by them.
     // Trimming now and then returns every free page; it takes a millisecond or two here.
-    QTimer trim;
 #ifdef __GLIBC__
+    QTimer trim;
     QObject::connect(&trim, &QTimer::timeout, []() { malloc_trim(0); });
-    trim.start(kTrimIntervalMs);
+    trim.start(2000);
 #endif
 
     std::printf("delvix-host serving on http://%s:%u (data %s, site %s); Ctrl-C to stop\n",

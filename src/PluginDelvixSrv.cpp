@@ -29,6 +29,21 @@ struct AddBatch
     HDLR_DO_REQUEST_CB reply;
 };
 
+// One item's answer, shared by the copies of its callback. An item whose callback is released
+// without ever being called (a bookmark plug-in or relay that dropped the request) counts as a
+// failed bookmark, so that its batch still ends.
+struct ItemAnswer
+{
+    std::atomic<bool> answered{false};
+    std::function<void(bool bOk, const QVariantMap& result)> finish;
+    ~ItemAnswer()
+    {
+        if (!answered.exchange(true)) {
+            finish(false, QVariantMap());
+        }
+    }
+};
+
 } // namespace
 
 // An add batch that has not given its final reply yet. Whoever sets answered first gives it:
@@ -134,8 +149,7 @@ void PluginDelvixSrv::ConnectSignal()
 {
     notifyCameraInfoToSynchronizer();
     forwardReceiveRespData();
-    connect(this, &PluginDelvixSrv::addBookmarkResponse, this, &PluginDelvixSrv::addCaseItem,
-            Qt::AutoConnection);
+    connect(this, &PluginDelvixSrv::addBookmarkResponse, this, &PluginDelvixSrv::addCaseItem);
 }
 
 void PluginDelvixSrv::notifyCameraInfoToSynchronizer()
@@ -679,6 +693,40 @@ void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
     batch->reply = BatchReply{std::move(hdlrDoRequestCB), std::move(pCaseDatabase), pOpen};
     const std::shared_ptr<LifeGuard> pLifeGuard = m_pLifeGuard;
 
+    // Every reply of the batch goes out on the plug-in's thread, posted in order: a progress reply
+    // can never follow the final one, not even at unload, when the posted ones are discarded with
+    // the plug-in. The guard's lock is held only to post; the batch's lock only to count.
+    auto finish = [pLifeGuard, batch, pOpen](bool bOk, const QVariantMap& result) {
+        const auto post = [&pLifeGuard](auto step) {
+            std::lock_guard<std::mutex> lifeLock(pLifeGuard->mutex);
+            if (PluginDelvixSrv* pPlugin = pLifeGuard->pPlugin) {
+                QMetaObject::invokeMethod(
+                    pPlugin, [pPlugin, step] { step(pPlugin); }, Qt::QueuedConnection);
+            }
+        };
+        const HDLR_DO_REQUEST_CB client = batch->reply;
+        post([client, pOpen](PluginDelvixSrv*) {
+            if (!pOpen->answered.load()) {
+                client(false, RC_SUCCESS, QString(), QVariant());
+            }
+        });
+        QList<QVariant> results;
+        {
+            std::lock_guard<std::mutex> lock(batch->mutex);
+            if (bOk) {
+                batch->results.append(result);
+            }
+            if (++batch->completed < batch->total) {
+                return;
+            }
+            results = batch->results;
+        }
+        const QString code = results.size() == batch->total ? RC_SUCCESS : RC_FAILURE;
+        post([code, results, client](PluginDelvixSrv* pPlugin) {
+            emit pPlugin->addBookmarkResponse(code, results, client);
+        });
+    };
+
     for (const QVariant& element : caseItemList) {
         const QVariantMap item = element.toMap();
         const QString node = item.value(KEY_NODE_ID).toString();
@@ -687,39 +735,24 @@ void PluginDelvixSrv::handleAddCaseItem(const QList<QVariant>& caseItemList,
 
         // Counts the first answer of its item only: a bookmark plug-in that answers twice must
         // neither count twice nor end the batch a second time.
-        auto answered = std::make_shared<std::atomic<bool>>(false);
-        HDLR_DO_REQUEST_CB itemCallback = [pLifeGuard, batch, pOpen, item, relay,
-                                           answered](bool, const QString& strCode, const QString&,
-                                                     const QVariant& payload) {
-            if (answered->exchange(true)) {
+        auto pAnswer = std::make_shared<ItemAnswer>();
+        pAnswer->finish = finish;
+        HDLR_DO_REQUEST_CB itemCallback = [pAnswer, item, relay](bool, const QString& strCode, const QString&,
+                                                                 const QVariant& payload) {
+            if (pAnswer->answered.exchange(true)) {
                 return;
             }
-            bool bOk = false;
-            QVariantMap result;
             if (strCode != RC_SUCCESS) {
                 DELVIX_LOG(LogFacility::LevelError, "AddBookmark response failed: %s (%s)",
                            qPrintable(strCode), qPrintable(relay));
-            } else {
-                result = item;
-                if (!result.contains(KEY_BOOKMARK_ID)) {
-                    result.insert(KEY_BOOKMARK_ID, payload.toMap().value(KEY_BM_BOOKMARK_ID).toString());
-                }
-                bOk = true;
+                pAnswer->finish(false, QVariantMap());
+                return;
             }
-            if (batch->reply && !pOpen->answered.load()) {
-                batch->reply(false, RC_SUCCESS, QString(), QVariant());
+            QVariantMap result = item;
+            if (!result.contains(KEY_BOOKMARK_ID)) {
+                result.insert(KEY_BOOKMARK_ID, payload.toMap().value(KEY_BM_BOOKMARK_ID).toString());
             }
-            std::lock_guard<std::mutex> lock(batch->mutex);
-            if (bOk) {
-                batch->results.append(result);
-            }
-            if (++batch->completed == batch->total) {
-                const QString code = batch->results.size() == batch->total ? RC_SUCCESS : RC_FAILURE;
-                std::lock_guard<std::mutex> lifeLock(pLifeGuard->mutex);
-                if (pLifeGuard->pPlugin) {
-                    emit pLifeGuard->pPlugin->addBookmarkResponse(code, batch->results, batch->reply);
-                }
-            }
+            pAnswer->finish(true, result);
         };
 
         if (!item.value(KEY_NEED_BOOKMARK).toBool()) {

@@ -222,30 +222,79 @@ TEST_F(PluginCasesTest, BatchesAreAnsweredOnceWhateverTheBookmarkPluginDoes)
     m_manager.registerPluginObject(PLUGIN_ID_BOOKMARK, &holding);
     const QVariantMap bookmark{{KEY_BM_BOOKMARK_ID, QStringLiteral("b1")}};
     auto answer = [&](int i) { holding.callbacks[i](true, RC_SUCCESS, QString(), bookmark); };
-    ReplyRecorder twice, waiting;
-    // Double answers count once.
     const QVariantMap twoItems = batch("two", {item("c1", true), item("c2", true)});
+    auto counts = [](std::initializer_list<const ReplyRecorder*> recorders) {
+        std::string text;
+        for (const ReplyRecorder* recorder : recorders) {
+            text += std::to_string(recorder->replies().size()) + recorder->last().code.toStdString() + " ";
+        }
+        return text;
+    };
+    // Double and late answers count once; a request released unanswered is a failed bookmark.
+    ReplyRecorder twice, dropped;
     m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, twoItems, m_sender, twice.callback());
-    ASSERT_EQ(holding.callbacks.size(), 2);
-    answer(0);
-    answer(0);
-    EXPECT_EQ(twice.replies().size(), 1u);
-    answer(1);
-    ASSERT_TRUE(twice.waitFinal());
-    answer(1);
-    QCoreApplication::processEvents();
-    EXPECT_EQ(twice.replies().size(), 3u);
-
-    // The plug-in goes while a batch waits: the client gets its final answer then, and a late
-    // bookmark answer neither replies again nor writes anything.
-    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, twoItems, m_sender, waiting.callback());
+    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, twoItems, m_sender, dropped.callback());
     ASSERT_EQ(holding.callbacks.size(), 4);
+    const HDLR_DO_REQUEST_CB late = holding.callbacks[1];
+    answer(0);
+    answer(0);
+    answer(1);
     answer(2);
-    m_plugin.reset();
-    answer(3);
+    holding.callbacks.clear();
+    ASSERT_TRUE(twice.waitFinal() && dropped.waitFinal());
+    late(true, RC_SUCCESS, QString(), bookmark);
     QCoreApplication::processEvents();
-    EXPECT_EQ(summary(waiting), answered(RC_FAILURE, 2));
-    EXPECT_EQ(itemCounts(), QList<int>({2, 0}));
+    EXPECT_EQ(counts({&twice, &dropped}), "30 3-1 ");
+    EXPECT_EQ(itemCounts(), QList<int>({2, 1}));
+
+    // A client that adds again from its final reply, on the plug-in's thread, gets both answers.
+    ReplyRecorder second;
+    const HDLR_DO_REQUEST_CB again = second.callback();
+    m_plugin->Request(CMD_ADD_CASE_WITH_ITEM, batch("first", {item("c1", false)}), m_sender,
+                      [&](bool final, const QString&, const QString&, const QVariant&) {
+                          final ? m_plugin->Request(CMD_ADD_CASE_WITH_ITEM,
+                                                    batch("second", {item("c2", false)}), m_sender, again)
+                                : void();
+                      });
+    ASSERT_TRUE(second.waitFinal());
+    EXPECT_EQ(itemCounts(), QList<int>({2, 1, 1, 1}));
+
+    // The plug-in goes while bookmarks are answered on another thread. A progress reply that is
+    // under way there when the plug-in goes (held until the final reply came) must not follow it.
+    ReplyRecorder waiting;
+    const HDLR_DO_REQUEST_CB record = waiting.callback();
+    const std::thread::id testThread = std::this_thread::get_id();
+    std::atomic<bool> held{false};
+    const auto holdOne = [&](bool final, const QString& code, const QString& message,
+                             const QVariant& payload) {
+        if (!final && std::this_thread::get_id() != testThread && !held.exchange(true)) {
+            for (int i = 0; i < 2000 && waiting.finalCount() == 0; ++i) {
+                std::this_thread::sleep_for(std::chrono::milliseconds(1));
+            }
+        }
+        record(final, code, message, payload);
+    };
+    QVariantList many;
+    for (int i = 0; i < 1000; ++i) {
+        many << item("c1", true);
+    }
+    m_plugin->Request(CMD_ADD_CASE_WITH_RECORDINGS, batch("many", many), m_sender, holdOne);
+    ASSERT_EQ(holding.callbacks.size(), 1000);
+    std::atomic<int> given{0};
+    std::thread answering([&] {
+        for (int i = 0; i < 999; ++i, ++given) {
+            answer(i);
+        }
+    });
+    while (given < 100 && !held) {
+        std::this_thread::yield();
+    }
+    m_plugin.reset();
+    answering.join();
+    QCoreApplication::processEvents();
+    EXPECT_EQ(waiting.finalCount(), 1);
+    EXPECT_TRUE(waiting.last().final);
+    EXPECT_EQ(itemCounts(), QList<int>({2, 1, 1, 1, 0}));
 }
 
 TEST_F(PluginCasesTest, CaseCommandsGuardTheData)

@@ -83,21 +83,25 @@ PluginDelvixSrv::PluginDelvixSrv()
 
 PluginDelvixSrv::~PluginDelvixSrv()
 {
-    DELVIX_SCOPE_TRACE("PluginDelvixSrv::~PluginDelvixSrv");
     {
-        // Late bookmark answers find the guard empty and leave this object alone.
-        std::lock_guard<std::mutex> lock(m_pLifeGuard->mutex);
-        m_pLifeGuard->pPlugin = nullptr;
-    }
-    // Batches still waiting for bookmarks get their final answer now, and store nothing.
-    std::vector<std::shared_ptr<OpenBatch>> openBatches;
-    {
-        std::lock_guard<std::mutex> lock(m_openBatchesMutex);
-        openBatches.swap(m_openBatches);
-    }
-    for (const std::shared_ptr<OpenBatch>& pOpen : openBatches) {
-        if (!pOpen->answered.exchange(true)) {
-            reply(pOpen->client, RC_FAILURE, QVariant());
+        // The pair covers this object's own work; what its components log while they are
+        // released below comes after the leave line.
+        DELVIX_SCOPE_TRACE("PluginDelvixSrv::~PluginDelvixSrv");
+        {
+            // Late bookmark answers find the guard empty and leave this object alone.
+            std::lock_guard<std::mutex> lock(m_pLifeGuard->mutex);
+            m_pLifeGuard->pPlugin = nullptr;
+        }
+        // Batches still waiting for bookmarks get their final answer now, and store nothing.
+        std::vector<std::shared_ptr<OpenBatch>> openBatches;
+        {
+            std::lock_guard<std::mutex> lock(m_openBatchesMutex);
+            openBatches.swap(m_openBatches);
+        }
+        for (const std::shared_ptr<OpenBatch>& pOpen : openBatches) {
+            if (!pOpen->answered.exchange(true)) {
+                reply(pOpen->client, RC_FAILURE, QVariant());
+            }
         }
     }
     setCaseDatabase(nullptr);
@@ -197,7 +201,6 @@ void PluginDelvixSrv::handleReceiveCameraResponseData(const QVariantMap& cameraI
 
 void PluginDelvixSrv::AllPluginLoaded()
 {
-    DELVIX_SCOPE_TRACE("PluginDelvixSrv::AllPluginLoaded");
     if (!m_pPluginManager || !m_pPluginManager->ConnectPluginSignal(
                                  PLUGIN_ID_SERVER_INFO, "2serverDatabasePathChanged(const QString &)", this,
                                  "1onServerDatabasePathChanged(const QString &)", 0)) {

@@ -5,6 +5,7 @@
 #include "CameraProxy.h"
 #include "FakeWemlo.h"
 #include "HostFakes.h"
+#include "PluginDelvixSrv.h"
 #include "ScopeTracer.h"
 
 #include <QStringList>
@@ -42,6 +43,13 @@ void traced(int path = 0)
     } catch (const std::runtime_error&) {
     }
 }
+
+// A camera directory whose teardown shows in the log.
+class LoggingCollector : public FakeCollector
+{
+public:
+    ~LoggingCollector() override { DELVIX_LOG(LogFacility::LevelError, "%s", "collector released"); }
+};
 
 } // namespace
 
@@ -95,4 +103,25 @@ TEST(LogFacilityTest, WritesThroughTheLastModuleTracesEveryWayOutAndIsSilentWith
     EXPECT_EQ(written(logging, 0, "libm.so.6"), "0 checks 0 writes ");
     EXPECT_FALSE(LogFacility::allow(LogFacility::LevelError, __FILE__, __LINE__));
     written([] {});
+}
+
+TEST(LogFacilityTest, PluginTracesItsEntryPointsAndLeavesBeforeItsComponentsGo)
+{
+    TestTools tools;
+    written([&] {
+        auto plugin = std::make_unique<PluginDelvixSrv>();
+        plugin->setCameraInformationCollector(
+            QSharedPointer<ICameraInformationCollector>(new LoggingCollector));
+        plugin->InitialPluginBase(&tools);
+        plugin->AllPluginLoaded();
+        plugin.reset();
+    });
+    std::string traces;
+    for (const auto& line : fakeWemloState().lines) {
+        const bool teardown = line.text.find("released") != std::string::npos;
+        traces += line.selector == 2309 || teardown ? line.text + ";" : "";
+    }
+    EXPECT_EQ(traces, "PluginDelvixSrv::InitialPluginBase, Enter;PluginDelvixSrv::InitialPluginBase, Leave;"
+                      "PluginDelvixSrv::~PluginDelvixSrv, Enter;PluginDelvixSrv::~PluginDelvixSrv, Leave;"
+                      "collector released;");
 }

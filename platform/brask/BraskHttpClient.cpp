@@ -141,15 +141,20 @@ void BraskHttpClient::start(const Call& call, const std::shared_ptr<CompletionOn
         exchange.timer->start(int(qMin<unsigned int>(call.timeoutMs, unsigned(INT_MAX))));
     }
     m_exchanges.insert(reply, exchange);
-    if (m_options.maxBodyBytes > 0) {
-        connect(reply, &QNetworkReply::downloadProgress, this, [this, reply](qint64 received, qint64 total) {
-            auto it = m_exchanges.find(reply);
-            if (it != m_exchanges.end() && !it->tooLarge && qMax(received, total) > m_options.maxBodyBytes) {
-                it->tooLarge = true;
-                reply->abort();
-            }
-        });
-    }
+    // The time limit counts silence, not the whole exchange: every byte that arrives starts it
+    // again, so a long answer that keeps streaming is never cut off.
+    connect(reply, &QNetworkReply::downloadProgress, this, [this, reply](qint64 received, qint64 total) {
+        auto it = m_exchanges.find(reply);
+        if (it == m_exchanges.end() || it->tooLarge || it->timedOut) {
+            return;
+        }
+        if (m_options.maxBodyBytes > 0 && qMax(received, total) > m_options.maxBodyBytes) {
+            it->tooLarge = true;
+            reply->abort();
+        } else if (it->timer) {
+            it->timer->start();
+        }
+    });
 }
 
 void BraskHttpClient::onFinished(QNetworkReply* reply)

@@ -29,8 +29,9 @@ public:
 
     // path holds the path and the query, already percent-encoded where needed. user and password
     // answer a basic or digest challenge (never sent unasked); credentials a host accepted may be
-    // reused for it until it challenges again. timeoutMs bounds the whole
-    // exchange; 0 means no limit. list: extra request headers as "Name: value" texts.
+    // reused for it until it challenges again. timeoutMs bounds the silence: the call ends with
+    // TimeoutError when no byte arrived for that long; 0 means no limit. list: extra request headers as
+    // "Name: value" texts.
     virtual bool
     Get(const QString& host, const QString& path, quint16 port, bool useSSL, const QString& user,
         const QString& password,

@@ -104,10 +104,10 @@ quint16 CameraSimulator::port(const QString& camera) const
     return c ? c->port() : 0;
 }
 
-void CameraSimulator::setSlow(const QString& camera, int delayMs)
+void CameraSimulator::setSlow(const QString& camera, int delayMs, bool streaming)
 {
     if (SimulatedCamera* c = find(camera)) {
-        c->setSlow(delayMs);
+        c->setSlow(delayMs, streaming);
     }
 }
 

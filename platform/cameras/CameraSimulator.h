@@ -43,7 +43,8 @@ public:
     void stop();
 
     quint16 port(const QString& camera) const;
-    void setSlow(const QString& camera, int delayMs);
+    // Answers after delayMs of silence; streaming: at once, in eight parts delayMs apart.
+    void setSlow(const QString& camera, int delayMs, bool streaming = false);
     void setFailing(const QString& camera, bool failing);
     void setMalformed(const QString& camera, bool malformed);
     QStringList issuedPairTokens(const QString& camera) const;

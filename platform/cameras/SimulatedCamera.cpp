@@ -240,16 +240,23 @@ bool SimulatedCamera::handleRequest(const QHttpServerRequest& request, QTcpSocke
     }
 
     const int delay = m_slowMs;
-    if (delay <= 0) {
+    if (delay <= 0 || (m_streaming && answer.status != 200)) { // only a body worth streaming streams
         send(socket, answer);
     } else {
+        // Silent for the delay, then the whole answer; or, streaming, eight parts a delay apart.
         // The socket may be gone by then (the client gave up): only answer a live one.
         QPointer<QTcpSocket> guarded(socket);
-        QTimer::singleShot(delay, this, [this, guarded, answer]() {
-            if (guarded && guarded->state() == QAbstractSocket::ConnectedState) {
-                send(guarded, answer);
-            }
-        });
+        const QByteArray whole = encoded(answer);
+        const int parts = m_streaming ? 8 : 1;
+        const qsizetype size = whole.size() / parts + 1;
+        for (int i = 0; i < parts; ++i) {
+            QTimer::singleShot(m_streaming ? delay * i : delay, this,
+                               [guarded, piece = whole.mid(i * size, size)]() {
+                                   if (guarded && guarded->state() == QAbstractSocket::ConnectedState) {
+                                       guarded->write(piece);
+                                   }
+                               });
+        }
     }
     return true;
 }
@@ -263,10 +270,15 @@ void SimulatedCamera::missingHandler(const QHttpServerRequest&, QTcpSocket* sock
 
 void SimulatedCamera::send(QTcpSocket* socket, const Answer& answer)
 {
+    socket->write(encoded(answer));
+}
+
+QByteArray SimulatedCamera::encoded(const Answer& answer)
+{
     QByteArray head = "HTTP/1.1 " + QByteArray::number(answer.status) + ' ' + reason(answer.status) + "\r\n";
     head += "Content-Type: " + answer.contentType + "\r\n";
     head += "Content-Length: " + QByteArray::number(answer.body.size()) + "\r\n";
     head += answer.extraHeaders;
     head += "\r\n";
-    socket->write(head + answer.body);
+    return head + answer.body;
 }

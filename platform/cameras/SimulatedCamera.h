@@ -29,7 +29,11 @@ public:
     quint16 port() const { return m_port; }
     const CameraSetup& setup() const { return m_setup; }
 
-    void setSlow(int delayMs) { m_slowMs = delayMs; }
+    void setSlow(int delayMs, bool streaming)
+    {
+        m_slowMs = delayMs;
+        m_streaming = streaming;
+    }
     void setFailing(bool failing) { m_failing = failing; }
     void setMalformed(bool malformed) { m_malformed = malformed; }
     QStringList issuedPairTokens() const;
@@ -50,6 +54,7 @@ private:
     bool digestAuthorised(const QByteArray& header) const;
     Answer challenge();
     void send(QTcpSocket* socket, const Answer& answer);
+    static QByteArray encoded(const Answer& answer);
 
     const CameraSetup m_setup;
     const ObjectGenerator* m_generator; // owned by the simulator, outlives every camera
@@ -57,6 +62,7 @@ private:
     const std::function<void(const ServedRequest&)> m_onServed;
     quint16 m_port = 0;
     std::atomic<int> m_slowMs{0};
+    std::atomic<bool> m_streaming{false};
     std::atomic<bool> m_failing{false};
     std::atomic<bool> m_malformed{false};
     mutable QMutex m_mutex;

@@ -197,7 +197,8 @@ TEST_F(HttpCamerasTest, EveryCallEndsOnceOnTheOwnerThreadWithQtsCode)
         {"door", w, "failing", QNetworkReply::InternalServerError},
         {"door", w, "malformed", QNetworkReply::NoError},
         {"door", w, "small limit", QNetworkReply::UnknownContentError},
-        {"door", w, "slow", QNetworkReply::TimeoutError},
+        {"door", w, "slow", QNetworkReply::TimeoutError}, // silent for longer than the limit
+        {"door", w, "streaming", QNetworkReply::NoError}, // slower than the limit, never silent as long
         {"closed", w, "", QNetworkReply::ConnectionRefusedError},
         {"none", w, "", QNetworkReply::ProtocolInvalidOperationError}, // port 0
     };
@@ -210,11 +211,14 @@ TEST_F(HttpCamerasTest, EveryCallEndsOnceOnTheOwnerThreadWithQtsCode)
         clients.push_back(std::make_unique<BraskHttpClient>(options));
         m_cameras.setFailing("door", row.change == "failing");
         m_cameras.setMalformed("door", row.change == "malformed");
-        m_cameras.setSlow("door", row.change == "slow" ? scaledMs(3000) : 0);
+        const bool slow = row.change == "slow", streaming = row.change == "streaming";
+        m_cameras.setSlow("door", slow ? scaledMs(3000) : streaming ? scaledMs(100) : 0, streaming);
         m_cameras.clearServedRequests();
-        const bool slow = row.change == "slow", wrongPassword = row.change == "wrong password";
+        const bool wrongPassword = row.change == "wrong password";
         auto out = get(*clients.back(), row.camera, row.path, wrongPassword ? u"x"_s : u"admin"_s,
-                       slow ? scaledMs(200) : 10000);
+                       slow        ? scaledMs(200)
+                       : streaming ? scaledMs(500)
+                                   : 10000);
         outcomes.push_back(out);
         ASSERT_TRUE(waitFor([&] { return out->calls > 0; }));
         // An abandoned call has no body; with a wrong password one challenge is answered, the second

@@ -37,6 +37,7 @@ NovirConfigServer::NovirConfigServer(const NovirSite& site, QObject* parent)
     , m_context(std::make_unique<QObject>())
     , m_strServerId(site.serverId)
     , m_partSize(qMax(1, site.partSize))
+    , m_prettyXml(site.prettyXml)
 {
     for (const NovirCamera& camera : site.cameras) {
         m_cameras.insert(camera.name, camera);
@@ -225,6 +226,7 @@ NovirSite NovirConfigServer::site() const
     NovirSite site;
     site.serverId = m_strServerId;
     site.partSize = m_partSize;
+    site.prettyXml = m_prettyXml;
     site.cameras = m_cameras.values();
     return site;
 }
@@ -287,8 +289,8 @@ bool NovirConfigServer::insertRequest(const QString&, void*, NSNovirTunnelClient
     post([this, cmdName, request]() {
         const QList<Part> parts = answer(cmdName, request.strContent);
         for (qsizetype i = 0; i < parts.size(); ++i) {
-            request.respCB(parts.at(i).success, cmdName, QString(), parts.at(i).retCode, parts.at(i).text,
-                           i == parts.size() - 1);
+            request.respCB(parts.at(i).success, cmdName, QString(), parts.at(i).retCode,
+                           shaped(parts.at(i).text), i == parts.size() - 1);
         }
         {
             QMutexLocker locker(&m_mutex);
@@ -328,7 +330,7 @@ bool NovirConfigServer::insertSubscribeRequest(const QString& pluginId, void* cl
             serverId = m_strServerId;
         }
         eventHandler(clientHandle(NSNovirTunnelClient::ConfigServer), serverId, kCamStatus,
-                     NSNovirTunnelClient::ConfigServer, QString(), status);
+                     NSNovirTunnelClient::ConfigServer, QString(), shaped(status));
     });
     return true;
 }
@@ -500,6 +502,11 @@ NovirConfigServer::Part NovirConfigServer::ingestMetaInfo(const QString& content
                 QStringLiteral("<InputObjectMetaInfo><Count>%1</Count></InputObjectMetaInfo>").arg(stored)};
 }
 
+QString NovirConfigServer::shaped(const QString& xml) const
+{
+    return m_prettyXml ? NovirSite::indentedXml(xml) : xml;
+}
+
 void NovirConfigServer::broadcast(const QString& name, const QString& relayPath, const QString& message)
 {
     QList<NSNovirTunnelClient::BroadcastHandler> handlers;
@@ -512,7 +519,7 @@ void NovirConfigServer::broadcast(const QString& name, const QString& relayPath,
     }
     for (const auto& handler : handlers) {
         handler(clientHandle(NSNovirTunnelClient::ConfigServer), name, NSNovirTunnelClient::ConfigServer,
-                relayPath, message);
+                relayPath, shaped(message));
     }
 }
 
@@ -529,6 +536,6 @@ void NovirConfigServer::sendCameraStatus(const QString& sourceId, const QString&
     }
     for (const auto& handler : handlers) {
         handler(clientHandle(NSNovirTunnelClient::ConfigServer), sourceId, kCamStatus,
-                NSNovirTunnelClient::ConfigServer, relayPath, message);
+                NSNovirTunnelClient::ConfigServer, relayPath, shaped(message));
     }
 }

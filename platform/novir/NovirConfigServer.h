@@ -102,6 +102,7 @@ private:
     QList<Part> answerNodeInfo(const QString& content);
     QList<Part> answerLocations();
     Part ingestMetaInfo(const QString& content);
+    QString shaped(const QString& xml) const; // indented when the site asks for it
     void broadcast(const QString& name, const QString& relayPath, const QString& message);
     void sendCameraStatus(const QString& sourceId, const QString& relayPath, const QString& message);
     QList<NovirCamera> camerasSorted() const;
@@ -113,8 +114,9 @@ private:
     char m_locationServerTag = 0;
 
     mutable QMutex m_mutex;
-    QString m_strServerId;                                                          // guarded by m_mutex
-    int m_partSize = 50;                                                            // guarded by m_mutex
+    QString m_strServerId; // guarded by m_mutex
+    int m_partSize = 50;   // guarded by m_mutex
+    const bool m_prettyXml;
     QMap<QString, NovirCamera> m_cameras;                                           // guarded by m_mutex
     bool m_configConnected = false;                                                 // guarded by m_mutex
     bool m_locationConnected = false;                                               // guarded by m_mutex

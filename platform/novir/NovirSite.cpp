@@ -5,6 +5,8 @@
 #include <QJsonDocument>
 #include <QJsonObject>
 #include <QSet>
+#include <QXmlStreamReader>
+#include <QXmlStreamWriter>
 #include <cmath>
 
 namespace {
@@ -115,6 +117,13 @@ bool NovirSite::fromJson(const QByteArray& json, NovirSite* site, QString* error
             return false;
         }
         result.partSize = partSize;
+    }
+    if (root.contains(QLatin1String("prettyXml"))) {
+        if (!root.value(QLatin1String("prettyXml")).isBool()) {
+            *error = QStringLiteral("\"prettyXml\" must be true or false");
+            return false;
+        }
+        result.prettyXml = root.value(QLatin1String("prettyXml")).toBool();
     }
     if (!root.value(QLatin1String("cameras")).isArray()) {
         *error = QStringLiteral("\"cameras\" must be a list");
@@ -252,4 +261,39 @@ QString NovirSite::cameraStatusXml(const QList<NovirCamera>& cameras)
     }
     xml += QStringLiteral("</CamStatus>");
     return xml;
+}
+
+QString NovirSite::indentedXml(const QString& xml)
+{
+    QXmlStreamReader reader(xml);
+    QString out;
+    QXmlStreamWriter writer(&out);
+    int depth = 0;
+    const auto newLine = [&] {
+        writer.writeCharacters(QLatin1Char('\n') + QString(2 * depth, QLatin1Char(' ')));
+    };
+    while (!reader.atEnd()) {
+        switch (reader.readNext()) {
+        case QXmlStreamReader::StartElement:
+            depth > 0 ? newLine() : void();
+            writer.writeStartElement(reader.name().toString());
+            writer.writeAttributes(reader.attributes());
+            ++depth;
+            break;
+        case QXmlStreamReader::EndElement:
+            --depth;
+            newLine();
+            writer.writeEndElement();
+            break;
+        case QXmlStreamReader::Characters:
+            if (!reader.isWhitespace()) {
+                newLine();
+                writer.writeCharacters(reader.text().toString());
+            }
+            break;
+        default:
+            break;
+        }
+    }
+    return reader.hasError() ? xml : out;
 }

@@ -32,7 +32,8 @@ class NovirSite
 {
 public:
     QString serverId = QStringLiteral("cfg-server-1");
-    int partSize = 50; // cameras or locations per answer part
+    int partSize = 50;      // cameras or locations per answer part
+    bool prettyXml = false; // answers and events indented, a line for every tag and every text
     QList<NovirCamera> cameras;
 
     // Parses a site file's text. Returns false with a reason in *error (and leaves *site alone).
@@ -48,5 +49,8 @@ public:
     // One location answer part; locations of cameras whose location is empty are left out.
     static QString locationsXml(const QList<NovirCamera>& cameras);
     static QString cameraStatusXml(const QList<NovirCamera>& cameras);
+    // The same XML indented, every tag and every text on a line of its own, as servers that
+    // pretty-print their answers write it (leaf texts then carry whitespace around them).
+    static QString indentedXml(const QString& xml);
     static QString escape(const QString& text);
 };

@@ -291,42 +291,47 @@ TEST(DirectoryTest, DirectoryHoldsOnlineCamerasWithLocationsAndFollowsTheSite)
         return NovirCamera{name, u"127.0.0.1"_s, port, false, 0,       u"admin"_s, u"pw-"_s + name,
                            true, false,          1,    1,     location};
     };
-    NovirSite site;
-    site.serverId = u"cfg-it"_s;
-    site.partSize = 2; // the all-cameras answer comes in three parts
-    site.cameras = {camera(u"A"_s, 18101, u"Loc1"_s), camera(u"B"_s, 18102, u"Loc2"_s),
-                    camera(u"C"_s, 18103, u"Loc3"_s), camera(u"D"_s, 18104, QString()),
-                    camera(u"E"_s, 18105, u"Loc5"_s), camera(u"F"_s, 18106, u"Loc6"_s)};
-    site.cameras[2].online = false;
-    site.cameras[4].protectCap = true;
-    site.cameras[5].recordCap = false;
-    NovirConfigServer server(site);
-    server.start();
-    TestTools tools(nullptr, &server);
-    CameraInformationCollector collector(&tools); // goes first: the server may still call its handlers
-    QStringList removedLocations;
-    QObject::connect(&collector, &ICameraInformationCollector::locationRemoved, &collector,
-                     [&](const QString& name) { removedLocations << name; });
-    // Waits for the directory to be "A(Port,Location,GroupID,IsRecording) ...".
-    auto directoryIs = [&](const QString& expected) {
-        const bool settled = waitFor([&] { return describe(collector.cameraDirectory()) == expected; });
-        EXPECT_EQ(describe(collector.cameraDirectory()), expected);
-        return settled;
-    };
-    ASSERT_TRUE(directoryIs(u"A(18101,Loc1,1,true) B(18102,Loc2,1,true) E(18105,Loc5,1,true)"_s));
-    EXPECT_EQ(collector.getCameraNodeID(u"Loc3"_s), u"C"_s); // offline, still located
+    // The same directory whether the server writes its XML compact or indented.
+    for (const bool pretty : {false, true}) {
+        SCOPED_TRACE(pretty ? "indented" : "compact");
+        NovirSite site;
+        site.serverId = u"cfg-it"_s;
+        site.partSize = 2; // the all-cameras answer comes in three parts
+        site.prettyXml = pretty;
+        site.cameras = {camera(u"A"_s, 18101, u"Loc1"_s), camera(u"B"_s, 18102, u"Loc2"_s),
+                        camera(u"C"_s, 18103, u"Loc3"_s), camera(u"D"_s, 18104, QString()),
+                        camera(u"E"_s, 18105, u"Loc5"_s), camera(u"F"_s, 18106, u"Loc6"_s)};
+        site.cameras[2].online = false;
+        site.cameras[4].protectCap = true;
+        site.cameras[5].recordCap = false;
+        NovirConfigServer server(site);
+        server.start();
+        TestTools tools(nullptr, &server);
+        CameraInformationCollector collector(&tools); // goes first: the server may still call its handlers
+        QStringList removedLocations;
+        QObject::connect(&collector, &ICameraInformationCollector::locationRemoved, &collector,
+                         [&](const QString& name) { removedLocations << name; });
+        // Waits for the directory to be "A(Port,Location,GroupID,IsRecording) ...".
+        auto directoryIs = [&](const QString& expected) {
+            const bool settled = waitFor([&] { return describe(collector.cameraDirectory()) == expected; });
+            EXPECT_EQ(describe(collector.cameraDirectory()), expected);
+            return settled;
+        };
+        ASSERT_TRUE(directoryIs(u"A(18101,Loc1,1,true) B(18102,Loc2,1,true) E(18105,Loc5,1,true)"_s));
+        EXPECT_EQ(collector.getCameraNodeID(u"Loc3"_s), u"C"_s); // offline, still located
 
-    server.setCameraOnline(u"C"_s, true);
-    server.setCameraOnline(u"A"_s, false);
-    server.changeCamera(camera(u"B"_s, 18202, u"Loc2"_s));
-    server.addCamera(camera(u"G"_s, 18107, u"Loc7"_s));
-    ASSERT_TRUE(directoryIs(
-        u"B(18202,Loc2,1,true) C(18103,Loc3,1,true) E(18105,Loc5,1,true) G(18107,Loc7,1,true)"_s));
-    server.removeChannel(u"C"_s);
-    server.addChannel(u"D"_s, u"Loc4"_s, 2);
-    server.removeCamera(u"E"_s);
-    ASSERT_TRUE(directoryIs(u"B(18202,Loc2,1,true) D(18104,Loc4,2,true) G(18107,Loc7,1,true)"_s));
-    EXPECT_EQ(removedLocations, QStringList{u"C"_s});
+        server.setCameraOnline(u"C"_s, true);
+        server.setCameraOnline(u"A"_s, false);
+        server.changeCamera(camera(u"B"_s, 18202, u"Loc2"_s));
+        server.addCamera(camera(u"G"_s, 18107, u"Loc7"_s));
+        ASSERT_TRUE(directoryIs(
+            u"B(18202,Loc2,1,true) C(18103,Loc3,1,true) E(18105,Loc5,1,true) G(18107,Loc7,1,true)"_s));
+        server.removeChannel(u"C"_s);
+        server.addChannel(u"D"_s, u"Loc4"_s, 2);
+        server.removeCamera(u"E"_s);
+        ASSERT_TRUE(directoryIs(u"B(18202,Loc2,1,true) D(18104,Loc4,2,true) G(18107,Loc7,1,true)"_s));
+        EXPECT_EQ(removedLocations, QStringList{u"C"_s});
+    }
 }
 
 TEST_F(TunnelControlTest, EachConnectionStartsItsWork)

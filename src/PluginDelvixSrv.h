@@ -180,8 +180,10 @@ private:
     // Lets answers that arrive on other threads after destruction find that the plug-in is gone.
     struct LifeGuard
     {
-        std::mutex mutex;
-        PluginDelvixSrv* pPlugin = nullptr; // guarded by mutex; null once destruction began
+        std::mutex mutex; // held to post to the plug-in, and to clear pPlugin
+        // Null once destruction began. Atomic too: ThreadSanitizer reported the destructor's write
+        // against a late answer's read under this lock (only after other tests in the process).
+        std::atomic<PluginDelvixSrv*> pPlugin{nullptr};
     };
     std::shared_ptr<LifeGuard> m_pLifeGuard;
     // std::mutex rather than QMutex, here and in the vault: ThreadSanitizer sees its locking.

@@ -86,7 +86,7 @@ QString AttributeVocabulary::describe(const QString& attribute, const QVariant& 
         for (const QVariant& element : value.toList()) {
             parts << describe(attribute, element);
         }
-        return parts.join(QStringLiteral(", "));
+        return parts.join(QLatin1Char('/'));
     }
     bool isCode = false;
     const double number = value.toDouble(&isCode);

@@ -27,7 +27,7 @@ public:
 
     const QStringList& words(const QString& attribute) const;
     int size(const QString& attribute) const { return int(words(attribute).size()); }
-    // A stored value in words: a code, a list of codes, or a text (an age) given back as it is.
+    // A stored value in words: a code, a list of codes (joined by "/"), or a text (an age) as it is.
     // A code outside the list reads "code N", so a camera that knows more words still shows.
     QString describe(const QString& attribute, const QVariant& value) const;
 

@@ -1,8 +1,9 @@
 #!/usr/bin/env python3
 """The explorer page of `delvix-host serve` in headless Chromium, on a small seeded store: the
 cameras, a search whose thumbnails decode, a re-identification that puts its own hit first, a
-case made from two hits and deleted, and the message for an empty window. Every wait is for an
-element or a state of the page, never a fixed time."""
+case made from two hits, changed and deleted, a drawn line rule, a client per tab, and the
+messages for an empty window, an unknown camera and a stopped host. Every wait is for an element
+or a state of the page, never a fixed time."""
 import argparse
 import os
 import re
@@ -13,8 +14,9 @@ import tempfile
 
 from selenium import webdriver
 from selenium.webdriver.chrome.service import Service
+from selenium.webdriver.common.action_chains import ActionChains
 from selenium.webdriver.common.by import By
-from selenium.webdriver.support.ui import WebDriverWait
+from selenium.webdriver.support.ui import Select, WebDriverWait
 
 SEEDED_FROM = 'Date.UTC(2024, 0, 1)'  # the seeder spreads its objects over four hours from here
 DECODED_THUMBS = "return [...document.querySelectorAll(arguments[0])].filter(i => i.complete && i.naturalWidth > 0).length"
@@ -36,7 +38,13 @@ def set_window(driver, start_expr, hours):
         document.getElementById('end').value = localInputValue(new Date(start.getTime() + {hours} * 3600e3));""")
 
 
-def check(driver, wait, screenshot):
+def search_message(driver, wait):
+    driver.find_element(By.ID, 'search-button').click()
+    wait.until(lambda d: d.find_element(By.ID, 'message').is_displayed())
+    return driver.find_element(By.ID, 'message').text
+
+
+def check(driver, wait, screenshot, stop_host):
     css = lambda selector: driver.find_elements(By.CSS_SELECTOR, selector)
     wait.until(lambda d: len(css('#cameras tr[data-camera]')) == 5)
     table = driver.find_element(By.ID, 'cameras').text
@@ -44,11 +52,12 @@ def check(driver, wait, screenshot):
 
     # An empty window is refused on the page, before anything is asked.
     set_window(driver, SEEDED_FROM, 0)
-    driver.find_element(By.ID, 'search-button').click()
-    wait.until(lambda d: d.find_element(By.ID, 'message').is_displayed())
-    assert 'time window is empty' in driver.find_element(By.ID, 'message').text
-
+    assert 'time window is empty' in search_message(driver, wait)
     set_window(driver, SEEDED_FROM, 4)
+    driver.find_element(By.ID, 'places').send_keys('Nowhere')
+    assert 'Unknown camera or location: Nowhere' in search_message(driver, wait)
+    driver.find_element(By.ID, 'places').clear()
+
     driver.find_element(By.ID, 'search-button').click()
     wait.until(lambda d: d.find_element(By.ID, 'search-section').get_attribute('data-state') == 'done')
     assert driver.find_element(By.ID, 'count').text == '201 shown, refine to see more'
@@ -77,10 +86,37 @@ def check(driver, wait, screenshot):
     cases = lambda: ' '.join(driver.execute_script(TEXTS, case))
     wait.until(lambda d: 'Browser case' in cases())
     wait.until(lambda d: d.execute_script(DECODED_THUMBS, case + ' img.cover') >= 1)
+    css(case + ' button.open')[0].click()
+    wait.until(lambda d: len(css('#case-items article')) == 2)
+    css('#case-items button.remove')[0].click()
+    wait.until(lambda d: len(css('#case-items article')) == 1)
+    driver.find_element(By.ID, 'case-rename').send_keys(' renamed')
+    driver.find_element(By.ID, 'case-rename-button').click()
+    wait.until(lambda d: 'Browser case renamed' in cases())
     delete = css(case + ' button.delete')[0]
     delete.click()
     delete.click()  # the second click confirms
     wait.until(lambda d: 'Browser case' not in cases())
+
+    # A drawn line on one camera's frame: a search of that camera for the objects that crossed it.
+    Select(driver.find_element(By.ID, 'rule-kind')).select_by_value('lineCrossing')
+    canvas = driver.find_element(By.ID, 'rule-canvas')
+    ActionChains(driver).move_to_element_with_offset(canvas, 0, -80).click().move_to_element_with_offset(
+        canvas, 0, 80).click().perform()
+    driver.find_element(By.ID, 'search-button').click()
+    wait.until(lambda d: re.fullmatch(r'\d+ shown', d.find_element(By.ID, 'count').text))
+    assert 0 < len(css('#hits article')) < 201 and {t.split(' · ')[0] for t in driver.execute_script(
+        TEXTS, '#hits .where')} == {'Entrance'}
+
+    # Each tab is a client of its own, so one tab's stop cannot end another's search.
+    first_client, url = driver.find_element(By.ID, 'client-name').text, driver.current_url
+    driver.switch_to.new_window('tab')
+    driver.get(url)
+    wait.until(lambda d: len(css('#cameras tr[data-camera]')) == 5)
+    assert driver.find_element(By.ID, 'client-name').text not in ('', first_client)
+
+    stop_host()
+    assert 'does not answer' in search_message(driver, wait)
 
 
 def main():
@@ -100,7 +136,7 @@ def main():
             assert port, 'serve did not start'
             driver = browser()
             driver.get(f'http://127.0.0.1:{port.group(1)}/')
-            check(driver, WebDriverWait(driver, 60), args.screenshot)
+            check(driver, WebDriverWait(driver, 60), args.screenshot, lambda: (serve.terminate(), serve.wait(60)))
         finally:
             if driver:
                 driver.quit()

@@ -26,7 +26,8 @@ TEXTS = "return [...document.querySelectorAll(arguments[0])].map(e => e.textCont
 
 def browser():
     options = webdriver.ChromeOptions()
-    options.binary_location = shutil.which('chromium') or shutil.which('chromium-browser') or ''
+    options.binary_location = shutil.which('chromium') or ''
+    assert options.binary_location and shutil.which('chromedriver'), 'chromium and chromedriver: run ./run deps'
     for flag in ('--headless=new', '--no-sandbox', '--disable-dev-shm-usage', '--window-size=1400,1600'):
         options.add_argument(flag)
     return webdriver.Chrome(service=Service(shutil.which('chromedriver')), options=options)
@@ -57,6 +58,10 @@ def check(driver, wait, screenshot, stop_host):
     driver.find_element(By.ID, 'places').send_keys('Nowhere')
     assert 'Unknown camera or location: Nowhere' in search_message(driver, wait)
     driver.find_element(By.ID, 'places').clear()
+    tick = "document.querySelectorAll('#camera-picks input').forEach(box => { box.checked = arguments[0]; })"
+    driver.execute_script(tick, False)
+    assert 'Pick at least one camera' in search_message(driver, wait)
+    driver.execute_script(tick, True)
 
     driver.find_element(By.ID, 'search-button').click()
     wait.until(lambda d: d.find_element(By.ID, 'search-section').get_attribute('data-state') == 'done')

@@ -169,15 +169,16 @@ function renderCameras() {
   }
   $('cameras-status').textContent = state.cameras.length + ' camera(s) in the plug-in\'s directory.';
 
+  // The person's ticks survive a refresh of the list; a camera new to the list starts ticked.
   const picks = $('camera-picks');
-  const chosen = new Set(Array.from(picks.querySelectorAll('input:checked'), (box) => box.value));
+  const ticked = new Map(Array.from(picks.querySelectorAll('input'), (box) => [box.value, box.checked]));
   picks.replaceChildren();
   const ruleCamera = $('rule-camera');
   const ruleChoice = ruleCamera.value;
   ruleCamera.replaceChildren();
   for (const camera of state.cameras) {
     const box = element('input', {type: 'checkbox', value: camera.name});
-    box.checked = chosen.size === 0 || chosen.has(camera.name);
+    box.checked = ticked.has(camera.name) ? ticked.get(camera.name) : true;
     picks.append(element('label', {}, [box, ' ' + camera.name + ' (' + camera.location + ')']));
     ruleCamera.append(element('option', {value: camera.name, text: camera.name}));
   }
@@ -479,8 +480,9 @@ function drawRule() {
   const kind = $('rule-kind').value;
   $('direction-label').hidden = kind !== 'lineCrossing';
   $('duration-label').hidden = kind !== 'loitering';
-  $('rule-help').textContent = kind === 'lineCrossing' ? 'Click the two ends of the line; the arrow shows "along".'
-                             : kind === 'loitering' ? 'Click the corners of the zone (three or more).'
+  const only = ' A rule searches this camera only.';
+  $('rule-help').textContent = kind === 'lineCrossing' ? 'Click the two ends of the line; the arrow shows "along".' + only
+                             : kind === 'loitering' ? 'Click the corners of the zone (three or more).' + only
                              : 'No rule: every object in the window counts.';
   const paint = (image) => {
     context.fillStyle = '#20242a';

@@ -9,6 +9,11 @@ CameraSimulator::CameraSimulator(quint64 seed, QObject* parent)
     , m_generator(seed)
 {}
 
+CameraSimulator::CameraSimulator(quint64 seed, const AttributeVocabulary& vocabulary, QObject* parent)
+    : QObject(parent)
+    , m_generator(seed, 40, 20, vocabulary)
+{}
+
 CameraSimulator::~CameraSimulator()
 {
     stop();

@@ -35,6 +35,8 @@ class CameraSimulator : public QObject
 
 public:
     explicit CameraSimulator(quint64 seed = 1, QObject* parent = nullptr);
+    // Cameras whose attribute codes come from a site's vocabulary.
+    CameraSimulator(quint64 seed, const AttributeVocabulary& vocabulary, QObject* parent = nullptr);
     ~CameraSimulator() override;
 
     // The cameras' clock for checking access tokens (default: the system clock). Set before start().

@@ -1,5 +1,7 @@
 #include "ObjectGenerator.h"
 
+#include <QJsonArray>
+#include <QJsonDocument>
 #include <QtEndian>
 #include <cmath>
 #include <cstdio>
@@ -122,13 +124,26 @@ void appendFeature(QByteArray& out, const QVector<float>& base, quint64 noiseKey
     out.append(']');
 }
 
-const char* const kAges[] = {"Child", "Young", "Adult", "Middle", "Senior"};
 const char kPlateLetters[] = "ABCDEFGHJKLMNPRSTUVWXYZ";
+
+// A code the vocabulary holds for this attribute, drawn from bits of the object's traits.
+qint64 codeOf(const AttributeVocabulary& vocabulary, const char* attribute, quint64 bits)
+{
+    return qint64(bits % quint64(qMax(1, vocabulary.size(QLatin1String(attribute)))));
+}
+
+// A word of a site file as a JSON text (it may hold quotes).
+QByteArray jsonText(const QString& text)
+{
+    const QByteArray array = QJsonDocument(QJsonArray{text}).toJson(QJsonDocument::Compact);
+    return array.mid(1, array.size() - 2);
+}
 
 } // namespace
 
-ObjectGenerator::ObjectGenerator(quint64 seed, int people, int vehicles)
+ObjectGenerator::ObjectGenerator(quint64 seed, int people, int vehicles, AttributeVocabulary vocabulary)
     : m_seed(seed)
+    , m_vocabulary(std::move(vocabulary))
     , m_people(qMax(1, people))
     , m_vehicles(qMax(1, vehicles))
 {
@@ -226,14 +241,17 @@ void ObjectGenerator::appendObject(QByteArray& out, quint64 cameraKey, const Slo
     out.append(",\"EndTime\":");
     appendNumber(out, slot.second + duration);
     if (person) {
-        out.append(",\"Attributes\":{\"Age\":\"").append(kAges[traits % 5]).append("\",\"Gender\":");
-        appendNumber(out, qint64((traits >> 4) % 2));
+        const QStringList& ages = m_vocabulary.words(QStringLiteral("Age"));
+        out.append(",\"Attributes\":{\"Age\":")
+            .append(jsonText(ages.value(int(traits % quint64(qMax<qsizetype>(1, ages.size()))))))
+            .append(",\"Gender\":");
+        appendNumber(out, codeOf(m_vocabulary, "Gender", traits >> 4));
         out.append(",\"Accessories\":[");
-        appendNumber(out, qint64((traits >> 8) % 4));
+        appendNumber(out, codeOf(m_vocabulary, "Accessories", traits >> 8));
         out.append("],\"UpperColor\":[");
-        appendNumber(out, qint64((traits >> 12) % 10));
+        appendNumber(out, codeOf(m_vocabulary, "UpperColor", traits >> 12));
         out.append("],\"LowerColor\":[");
-        appendNumber(out, qint64((traits >> 16) % 10));
+        appendNumber(out, codeOf(m_vocabulary, "LowerColor", traits >> 16));
         out.append("]}");
     } else {
         QByteArray plate;
@@ -242,9 +260,9 @@ void ObjectGenerator::appendObject(QByteArray& out, quint64 cameraKey, const Slo
         }
         plate.append(QByteArray::number(100 + int((traits >> 24) % 900)));
         out.append(",\"Attributes\":{\"Type\":");
-        appendNumber(out, qint64((traits >> 4) % 6));
+        appendNumber(out, codeOf(m_vocabulary, "Type", traits >> 4));
         out.append(",\"Color\":[");
-        appendNumber(out, qint64((traits >> 12) % 10));
+        appendNumber(out, codeOf(m_vocabulary, "Color", traits >> 12));
         out.append("],\"PlateNumber\":\"").append(plate).append("\"}");
         out.append(",\"LicensePlateThumbnail\":[{\"image\":\"").append(m_thumbnails[identity]);
         out.append("\",\"PlateNumber\":\"").append(plate).append("\",\"detection_info\":{\"filtered\":0}}]");

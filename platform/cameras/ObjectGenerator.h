@@ -7,6 +7,8 @@
 // any other identity). What a camera answers for a window depends only on (seed, camera, window,
 // rate), so repeated or overlapping requests see the same objects. Thread-safe after construction.
 
+#include "AttributeVocabulary.h"
+
 #include <QByteArray>
 #include <QString>
 #include <QVector>
@@ -16,7 +18,10 @@ class ObjectGenerator
 public:
     static constexpr int kFeatureLength = 512;
 
-    explicit ObjectGenerator(quint64 seed = 1, int people = 40, int vehicles = 20);
+    // Attribute codes are drawn from the vocabulary's lists, so a site's cameras only make codes
+    // that its clients can put in words.
+    explicit ObjectGenerator(quint64 seed = 1, int people = 40, int vehicles = 20,
+                             AttributeVocabulary vocabulary = AttributeVocabulary::defaults());
 
     // The camera answer for the objects that start in [start, end) on this camera, at about
     // objectsPerMinute objects a minute: {"ObjectMetaInfo": [...]}.
@@ -43,6 +48,7 @@ private:
     void appendObject(QByteArray& out, quint64 cameraKey, const Slot& slot) const;
 
     quint64 m_seed;
+    AttributeVocabulary m_vocabulary;
     int m_people;
     int m_vehicles;
     QVector<QVector<float>> m_bodyFeatures; // per identity

@@ -125,6 +125,17 @@ bool NovirSite::fromJson(const QByteArray& json, NovirSite* site, QString* error
         }
         result.prettyXml = root.value(QLatin1String("prettyXml")).toBool();
     }
+    if (root.contains(QLatin1String("vocabulary"))) {
+        if (!root.value(QLatin1String("vocabulary")).isObject()) {
+            *error = QStringLiteral("\"vocabulary\" must be an object of word lists");
+            return false;
+        }
+        QString why;
+        if (!result.vocabulary.merge(root.value(QLatin1String("vocabulary")).toObject(), &why)) {
+            *error = QStringLiteral("vocabulary: %1").arg(why);
+            return false;
+        }
+    }
     if (!root.value(QLatin1String("cameras")).isArray()) {
         *error = QStringLiteral("\"cameras\" must be a list");
         return false;

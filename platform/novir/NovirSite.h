@@ -3,6 +3,8 @@
 // file (format in SITE_FORMAT.md beside this file), and the XML texts the server sends about
 // them. A plain value type; no threads, no I/O beyond fromFile.
 
+#include "AttributeVocabulary.h"
+
 #include <QByteArray>
 #include <QList>
 #include <QString>
@@ -35,6 +37,8 @@ public:
     int partSize = 50;      // cameras or locations per answer part
     bool prettyXml = false; // answers and events indented, a line for every tag and every text
     QList<NovirCamera> cameras;
+    // What the site's attribute codes mean: the built-in words, with a site file's lists over them.
+    AttributeVocabulary vocabulary = AttributeVocabulary::defaults();
 
     // Parses a site file's text. Returns false with a reason in *error (and leaves *site alone).
     static bool fromJson(const QByteArray& json, NovirSite* site, QString* error);

@@ -72,14 +72,14 @@ public:
     {}
 
     // The answer fills in while this thread's event loop turns.
-    ServeAnswerPtr post(const QString& path, const QByteArray& body)
+    ServeAnswerPtr post(const QString& path, const QByteArray& body, const QByteArray& verb = "POST")
     {
         QNetworkRequest request(QUrl(QStringLiteral("http://127.0.0.1:%1%2").arg(m_port).arg(path)));
         request.setHeader(QNetworkRequest::ContentTypeHeader, "application/json");
         // Generous: an answer still open after this is a lost reply, not a slow one.
         request.setTransferTimeout(scaledMs(120000));
         auto answer = std::make_shared<ServeAnswer>();
-        QNetworkReply* reply = m_network.post(request, body);
+        QNetworkReply* reply = m_network.sendCustomRequest(request, verb, body);
         // Lines are taken as they come: when the server dies, what arrived is what the client was told.
         auto take = [answer, reply](bool all) {
             while (reply->canReadLine() || (all && reply->bytesAvailable() > 0)) {
@@ -514,6 +514,23 @@ TEST(HostServe, StreamsJsonLinesRelaysRemoteBookmarksAndStopsCleanly)
         remoteBookmarks.open(QIODevice::ReadOnly) && remoteBookmarks.readAll().contains("Cam7");
     const ServeAnswerPtr bad = http.post("/request", R"({"client":"x"})");
     ServeConnection::wait(bad);
+    // The explorer page, and the directory it shows once the plug-in has learned the built-in site;
+    // a file name outside the page's own is not served.
+    QJsonObject cameras;
+    const bool learned = waitFor([&]() {
+        const ServeAnswerPtr answer = http.post("/host/cameras", {}, "GET");
+        ServeConnection::wait(answer);
+        cameras = answer->lines.value(0);
+        return cameras["cameras"].toArray().size() == 5;
+    });
+    const ServeAnswerPtr page = http.post("/", {}, "GET"),
+                         outside = http.post("/explorer/main.cpp", {}, "GET");
+    ServeConnection::wait(page), ServeConnection::wait(outside);
+    EXPECT_EQ(QString::asprintf("%d %s %d %d", learned,
+                                qPrintable(cameras.value("vocabulary")["Gender"][1].toString() +
+                                           cameras.value("notInDirectory")[0]["reason"].toString()),
+                                page->status, outside->status),
+              "1 maleoffline 200 405");
     const bool stopped = serve.stop();
     // Unknown command; the path form's lines, final first or not, its case and when it was listed as
     // made; the remote bookmark; a request without a command; the stop and the count of requests.
@@ -536,7 +553,8 @@ TEST(HostDemo, RunsTheWholeSystemAndEveryStepFindsSomething)
     for (const QString& line :
          {"camera directory" + found, "metadata synchronisation" + found, "attribute search" + found,
           "re-identification" + found, "case workflow" + found, QString("bookmarks left: 0"),
-          QString("demo complete")}) {
+          QString("demo complete"), QString("Human .+ (female|male), \\w+ top"),
+          QString("serve --data .+\\n\\s+then open http://127\\.0\\.0\\.1:8765/")}) {
         if (!QRegularExpression(line).match(out).hasMatch()) {
             missing << line;
         }

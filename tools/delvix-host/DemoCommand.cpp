@@ -95,31 +95,24 @@ QString timeText(qint64 ms)
     return QDateTime::fromMSecsSinceEpoch(ms).toString(QStringLiteral("hh:mm:ss"));
 }
 
-QString listText(const QVariant& value)
-{
-    QStringList parts;
-    for (const QVariant& element : value.toList()) {
-        parts << element.toString();
-    }
-    return value.typeId() == QMetaType::QVariantList ? parts.join(QLatin1Char(',')) : value.toString();
-}
-
-QString describe(const QVariantMap& hit)
+// Attributes in the site's words, not its codes.
+QString describe(const QVariantMap& hit, const AttributeVocabulary& words)
 {
     if (hit.value(QStringLiteral("objType")).toString() == QLatin1String("Human")) {
-        return QStringLiteral("age %1, gender %2, upper %3, lower %4")
-            .arg(hit.value(QStringLiteral("objectAge")).toString(),
-                 hit.value(QStringLiteral("objectGender")).toString(),
-                 listText(hit.value(QStringLiteral("objectUpperColor"))),
-                 listText(hit.value(QStringLiteral("objectLowerColor"))));
+        return QStringLiteral("%1, %2, %3 top, %4 bottom")
+            .arg(words.describe(QStringLiteral("Age"), hit.value(QStringLiteral("objectAge"))),
+                 words.describe(QStringLiteral("Gender"), hit.value(QStringLiteral("objectGender"))),
+                 words.describe(QStringLiteral("UpperColor"), hit.value(QStringLiteral("objectUpperColor"))),
+                 words.describe(QStringLiteral("LowerColor"), hit.value(QStringLiteral("objectLowerColor"))));
     }
-    return QStringLiteral("type %1, colour %2, plate %3")
-        .arg(hit.value(QStringLiteral("objectVehicleType")).toString(),
-             listText(hit.value(QStringLiteral("objectVehicleColor"))),
+    return QStringLiteral("%1 %2, plate %3")
+        .arg(words.describe(QStringLiteral("Color"), hit.value(QStringLiteral("objectVehicleColor"))),
+             words.describe(QStringLiteral("Type"), hit.value(QStringLiteral("objectVehicleType"))),
              hit.value(QStringLiteral("plateNumber")).toString());
 }
 
-void printHits(const QList<QVariantMap>& hits, bool withScores, int limit = 8)
+void printHits(const QList<QVariantMap>& hits, const AttributeVocabulary& words, bool withScores,
+               int limit = 8)
 {
     if (hits.isEmpty()) {
         std::printf("   (no hits)\n");
@@ -141,7 +134,7 @@ void printHits(const QList<QVariantMap>& hits, bool withScores, int limit = 8)
                     qUtf8Printable(hit.value(QStringLiteral("nodeID")).toString()),
                     qUtf8Printable(timeText(hit.value(QStringLiteral("startTimestamp")).toLongLong())),
                     qUtf8Printable(timeText(hit.value(QStringLiteral("endTimestamp")).toLongLong())),
-                    qUtf8Printable(scores), qUtf8Printable(describe(hit)));
+                    qUtf8Printable(scores), qUtf8Printable(describe(hit, words)));
     }
     if (hits.size() > limit) {
         std::printf("   ... and %lld more\n", static_cast<long long>(hits.size() - limit));
@@ -220,6 +213,7 @@ int runDemo(const HostOptions& options)
         std::fprintf(stderr, "delvix-host demo: the site did not start: %s\n", qUtf8Printable(error));
         return 1;
     }
+    const AttributeVocabulary& words = site.site().vocabulary;
     PluginHost host(dataDir);
     host.setNovirTunnelClient(&site.server());
     const QString module =
@@ -302,14 +296,15 @@ int runDemo(const HostOptions& options)
                              {QStringLiteral("locIDList"), locations}};
 
     // 3. Attribute search.
-    std::printf("\n== 3. Attribute search: people of gender 1 over every location in the last hour, newest "
-                "first.\n");
+    std::printf("\n== 3. Attribute search: %s people (gender 1) over every location in the last hour, newest "
+                "first.\n",
+                qUtf8Printable(words.describe(QStringLiteral("Gender"), 1)));
     timer.restart();
     QVariantMap params = window;
     params.insert(QStringLiteral("humanInfo"), QStringLiteral("{\"Gender\":1}"));
     params.insert(QStringLiteral("descending"), true);
     const QList<QVariantMap> people = hitsOf(request(host, QStringLiteral("startSearch"), params));
-    printHits(people, false);
+    printHits(people, words, false);
     step(QStringLiteral("attribute search"), timer, int(people.size()));
 
     // 4. Plate search, from a vehicle the store holds.
@@ -325,7 +320,7 @@ int runDemo(const HostOptions& options)
     params.insert(QStringLiteral("plateNumber"), pattern);
     const QList<QVariantMap> plates = hitsOf(request(host, QStringLiteral("startSearch"), params));
     std::printf("   plate \"%s\"\n", qUtf8Printable(pattern));
-    printHits(plates, false);
+    printHits(plates, words, false);
     step(QStringLiteral("plate search"), timer, int(plates.size()));
 
     // 5. Rule search: objects that crossed the vertical middle line of the image.
@@ -338,7 +333,7 @@ int runDemo(const HostOptions& options)
                               {QStringLiteral("trace"), QStringLiteral("[[0.5,0],[0.5,1]]")},
                               {QStringLiteral("direction"), 0}});
     const QList<QVariantMap> crossings = hitsOf(request(host, QStringLiteral("startSearch"), params));
-    printHits(crossings, false);
+    printHits(crossings, words, false);
     step(QStringLiteral("line-crossing search"), timer, int(crossings.size()));
 
     // 6. Re-identification of the first person found.
@@ -356,7 +351,7 @@ int runDemo(const HostOptions& options)
         std::sort(sightings.begin(), sightings.end(), [](const QVariantMap& a, const QVariantMap& b) {
             return a.value(QStringLiteral("score")).toDouble() > b.value(QStringLiteral("score")).toDouble();
         });
-        printHits(sightings, true);
+        printHits(sightings, words, true);
         QStringList where;
         for (const QVariantMap& hit : std::as_const(sightings)) {
             where << hit.value(QStringLiteral("locID")).toString();
@@ -453,5 +448,8 @@ int runDemo(const HostOptions& options)
                     !sightings.isEmpty() && caseOk;
     std::printf("   demo %s in %.1f s; data left in %s\n", ok ? "complete" : "INCOMPLETE",
                 double(total.elapsed()) / 1000.0, qUtf8Printable(dataDir));
+    std::printf("\n== To look at it in a browser: the explorer page (cameras, searches with thumbnails, "
+                "re-identification, cases)\n   %s serve --data %s\n   then open http://127.0.0.1:8765/\n",
+                qUtf8Printable(QCoreApplication::applicationFilePath()), qUtf8Printable(dataDir));
     return ok ? 0 : 1;
 }

@@ -5,9 +5,12 @@
 
 #include <QDir>
 #include <QFile>
+#include <QFileInfo>
 #include <QHttpServerRequest>
+#include <QJsonArray>
 #include <QJsonDocument>
 #include <QJsonObject>
+#include <QRegularExpression>
 #include <QStringList>
 #include <QTcpSocket>
 #include <QTimer>
@@ -129,6 +132,84 @@ void HostHttpApi::missingHandler(const QHttpServerRequest&, QTcpSocket* socket)
     writeSimple(socket, 404, "text/plain", "not found\n");
 }
 
+bool HostHttpApi::serveExplorer(const QString& path, QTcpSocket* socket)
+{
+    // Only plain file names of the built-in folder: nothing outside it can be named.
+    static const QRegularExpression fileName(QStringLiteral("^/explorer/([A-Za-z0-9_-]+\\.(js|css|png))$"));
+    const QRegularExpressionMatch match = fileName.match(path);
+    QString resource;
+    if (path == QLatin1String("/") || path == QLatin1String("/index.html")) {
+        resource = QStringLiteral(":/explorer/index.html");
+    } else if (match.hasMatch()) {
+        resource = QStringLiteral(":/explorer/") + match.captured(1);
+    } else {
+        return false;
+    }
+    QFile file(resource);
+    if (!file.open(QIODevice::ReadOnly)) {
+        writeSimple(socket, 404, "text/plain", "not found\n");
+        return true;
+    }
+    static const QHash<QString, QByteArray> types{{QStringLiteral("html"), "text/html; charset=utf-8"},
+                                                  {QStringLiteral("js"), "text/javascript; charset=utf-8"},
+                                                  {QStringLiteral("css"), "text/css; charset=utf-8"},
+                                                  {QStringLiteral("png"), "image/png"}};
+    const QByteArray body = file.readAll();
+    // The page may load from this host only; images come inline as data: addresses.
+    socket->write("HTTP/1.1 200 OK\r\nContent-Type: " + types.value(QFileInfo(resource).suffix()) +
+                  "\r\nContent-Security-Policy: default-src 'self'; img-src 'self' data:\r\n"
+                  "Cache-Control: no-cache\r\nContent-Length: " +
+                  QByteArray::number(body.size()) + "\r\nConnection: close\r\n\r\n" + body);
+    socket->disconnectFromHost();
+    return true;
+}
+
+QByteArray HostHttpApi::camerasReport() const
+{
+    QVariantMap directory;
+    if (m_host->plugin()) {
+        QMetaObject::invokeMethod(m_host->plugin(), "cameraDirectory", Qt::DirectConnection,
+                                  Q_RETURN_ARG(QVariantMap, directory));
+    }
+    QJsonArray cameras;
+    for (auto it = directory.cbegin(); it != directory.cend(); ++it) {
+        const QVariantMap record = it.value().toMap();
+        cameras.append(QJsonObject{{"name", it.key()},
+                                   {"location", record.value(QStringLiteral("Location")).toString()},
+                                   {"group", record.value(QStringLiteral("GroupID")).toInt()},
+                                   {"recording", record.value(QStringLiteral("IsRecording")).toBool()},
+                                   {"protected", record.value(QStringLiteral("DelvixProtect")).toBool()},
+                                   {"online", true}});
+    }
+    // The directory holds only cameras that record, have a location and are online.
+    QJsonArray left;
+    for (const NovirCamera& camera : m_site.cameras) {
+        if (directory.contains(camera.name)) {
+            continue;
+        }
+        QStringList reasons;
+        if (!camera.recordCap) {
+            reasons << QStringLiteral("records no object metadata");
+        }
+        if (camera.location.isEmpty()) {
+            reasons << QStringLiteral("has no recording location");
+        }
+        if (!camera.online) {
+            reasons << QStringLiteral("offline");
+        }
+        if (reasons.isEmpty()) {
+            reasons << QStringLiteral("not announced yet");
+        }
+        left.append(QJsonObject{{"name", camera.name},
+                                {"location", camera.location},
+                                {"online", camera.online},
+                                {"reason", reasons.join(QStringLiteral(", "))}});
+    }
+    const QJsonObject report{
+        {"cameras", cameras}, {"notInDirectory", left}, {"vocabulary", m_site.vocabulary.toJson()}};
+    return QJsonDocument(report).toJson(QJsonDocument::Compact) + '\n';
+}
+
 bool HostHttpApi::handleRequest(const QHttpServerRequest& request, QTcpSocket* socket)
 {
     const QString path = request.url().path();
@@ -139,6 +220,15 @@ bool HostHttpApi::handleRequest(const QHttpServerRequest& request, QTcpSocket* s
     if (path == QLatin1String("/host/memory")) {
         writeSimple(socket, 200, "application/json", memoryReport());
         return true;
+    }
+    if (request.method() == QHttpServerRequest::Method::Get) {
+        if (path == QLatin1String("/host/cameras")) {
+            writeSimple(socket, 200, "application/json", camerasReport());
+            return true;
+        }
+        if (serveExplorer(path, socket)) {
+            return true;
+        }
     }
     if (request.method() != QHttpServerRequest::Method::Post) {
         writeSimple(socket, 405, "text/plain", "use POST /request or POST /COMMAND\n");

@@ -4,7 +4,12 @@
 //
 //   POST /request   body {"command": NAME, "params": VALUE, "client": NAME, "wait": SECONDS}
 //   POST /NAME      body VALUE (the parameter), client from ?client=NAME or the X-Client header
+//   GET  /          the explorer page (explorer/ beside this file, built in as Qt resources);
+//                   GET /explorer/FILE its script and style
 //   GET  /health    {"ok": true}
+//   GET  /host/cameras   {"cameras": [...], "notInDirectory": [...], "vocabulary": {...}}: the
+//                   camera directory the plug-in learned, the site's cameras it left out and why,
+//                   and the words for the site's attribute codes
 //   GET  /host/memory   {"rssAnonKb": N, "heapBytes": N}: the server's anonymous resident memory
 //                   and what its live allocations take (the load test follows both)
 //   POST /host/databasePath   body {"path": FOLDER}: makes the folder and moves the server
@@ -28,6 +33,8 @@
 #include <QPointer>
 #include <memory>
 
+#include "NovirSite.h"
+
 class PluginHost;
 class QTcpSocket;
 
@@ -40,6 +47,8 @@ public:
     // False with a reason when the address is not a loopback one or the port is taken.
     bool listenOn(const QHostAddress& address, quint16 port, QString* error);
     quint16 port() const { return m_port; }
+    // The site whose cameras and vocabulary /host/cameras tells (the built-in site until set).
+    void setSite(const NovirSite& site) { m_site = site; }
     int requestsServed() const { return m_requestsServed; }
 
 protected:
@@ -50,11 +59,14 @@ private:
     void dispatch(QTcpSocket* socket, const QString& command, const QVariant& params, const QString& client,
                   double waitSeconds);
     void changeDatabasePath(const QByteArray& body, QTcpSocket* socket);
+    QByteArray camerasReport() const;
+    static bool serveExplorer(const QString& path, QTcpSocket* socket);
     std::shared_ptr<int> senderHandle(const QString& client);
     static void writeSimple(QTcpSocket* socket, int status, const QByteArray& contentType,
                             const QByteArray& body);
 
     PluginHost* m_host; // borrowed; outlives this server
+    NovirSite m_site = NovirSite::defaultSite();
     quint16 m_port = 0;
     int m_requestsServed = 0;
     // One address per client name while the client has a request open (its answers hold it), so

@@ -88,6 +88,7 @@ int runServe(QStringList args)
         return 1;
     }
     HostHttpApi api(&host);
+    api.setSite(runner.site());
     if (!api.listenOn(address, quint16(port), &error)) {
         std::fprintf(stderr, "delvix-host serve: %s\n", qUtf8Printable(error));
         host.unload();
@@ -112,7 +113,8 @@ int runServe(QStringList args)
     trim.start(2000);
 #endif
 
-    std::printf("delvix-host serving on http://%s:%u (data %s, site %s); Ctrl-C to stop\n",
+    std::printf("delvix-host serving on http://%s:%u (data %s, site %s); open the address in a browser "
+                "for the explorer; Ctrl-C to stop\n",
                 qUtf8Printable(address.toString()), unsigned(api.port()), qUtf8Printable(host.dataDir()),
                 qUtf8Printable(siteFile.isEmpty() ? QStringLiteral("built in") : siteFile));
     std::fflush(stdout);

@@ -4,6 +4,7 @@
 
 SiteRunner::SiteRunner(NovirSite site)
     : m_site(std::move(site))
+    , m_cameras(1, m_site.vocabulary)
 {}
 
 SiteRunner::~SiteRunner()

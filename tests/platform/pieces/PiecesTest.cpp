@@ -417,7 +417,9 @@ TEST(NovirSite, SiteFileIsReadAndABadOneLeavesTheSiteAlone)
               std::tuple(1, u"s9"_s, 2, 1234, true, 4443, u"pw"_s, true, 3, 2, u"Loc5"_s, 4, false, false));
     for (const char* json :
          {"[]", R"({"cameras":[{"port":80}]})", R"({"cameras":[{"name":"A","port":70000}]})",
-          R"({"cameras":[{"name":"A"},{"name":"A"}]})", R"({"partSize":0,"cameras":[]})"}) {
+          R"({"cameras":[{"name":"A"},{"name":"A"}]})", R"({"partSize":0,"cameras":[]})",
+          R"({"vocabulary":{"Hat":["x"]},"cameras":[]})", R"({"vocabulary":{"Type":[]},"cameras":[]})",
+          R"({"vocabulary":{"Type":["car",""]},"cameras":[]})", R"({"vocabulary":[],"cameras":[]})"}) {
         EXPECT_FALSE(NovirSite::fromJson(json, &site, &error) || site.serverId != u"s9"_s) << json;
     }
     NovirCamera odd; // texts are escaped
@@ -425,6 +427,36 @@ TEST(NovirSite, SiteFileIsReadAndABadOneLeavesTheSiteAlone)
     EXPECT_EQ(valuesAt(NovirSite::nodeInfoXml({odd}), u"NodeInfo/Cameras/Cam/Name"_s) +
                   valuesAt(NovirSite::locationsXml({odd}), u"LocRecs/LocList/Loc/Alias"_s),
               (QStringList{odd.name, odd.name}));
+}
+
+// A site's own words replace the built-in ones attribute by attribute, and its cameras then make
+// only codes those words cover (and ages that are its words, quotes and all).
+TEST(NovirSite, VocabularyOfASiteFileDrivesItsCamerasAndItsWords)
+{
+    NovirSite site;
+    QString error;
+    ASSERT_TRUE(NovirSite::fromJson(
+        R"({"cameras":[],"vocabulary":{"Type":["car","lorry","tractor"],"Age":["kid","\"old\""]}})", &site,
+        &error))
+        << qPrintable(error);
+    const AttributeVocabulary& words = site.vocabulary;
+    EXPECT_EQ(std::tuple(words.describe(u"Type"_s, 1), words.describe(u"Color"_s, QVariantList{0, 9}),
+                         words.describe(u"Gender"_s, 7), words.describe(u"Age"_s, u"kid"_s)),
+              std::tuple(u"lorry"_s, u"black/brown"_s, u"code 7"_s, u"kid"_s));
+    const ObjectGenerator generator(3, 5, 5, words);
+    const QJsonArray list = objects(generator.answer(u"cam"_s, 1'700'000'000, 1'700'000'600, 60));
+    QSet<int> types;
+    QSet<QString> ages;
+    for (const QJsonValue& object : list) {
+        const QJsonObject attributes = object["Attributes"].toObject();
+        if (attributes.contains(u"Type"_s)) {
+            types.insert(attributes["Type"].toInt());
+        } else {
+            ages.insert(attributes["Age"].toString());
+        }
+    }
+    EXPECT_TRUE(!types.isEmpty() && (QSet<int>{0, 1, 2}.contains(types))) << types.size();
+    EXPECT_EQ(ages, (QSet<QString>{u"kid"_s, u"\"old\""_s}));
 }
 
 TEST(NovirServer, AnswersComeInPartsFromTheServerThreadAndADownServerTakesNoRequest)

@@ -19,33 +19,38 @@ QString toQString(std::string_view utf8)
     return QString::fromUtf8(utf8.data(), qsizetype(utf8.size()));
 }
 
-// False where the tree could differ from QJsonDocument's.
-bool number(element value, QVariant* out)
+// A number as QJsonDocument keeps it; !ok where the tree could differ from QJsonDocument's.
+struct Number
 {
+    bool ok = true;
+    bool integer = true;
+    qlonglong whole = 0;
+    double real = 0;
+};
+
+Number readNumber(element value)
+{
+    Number number;
     switch (value.type()) {
     case element_type::INT64:
-        *out = QVariant(qlonglong(value.get_int64().value_unsafe()));
-        return true;
+        number.whole = value.get_int64().value_unsafe();
+        return number;
     case element_type::UINT64: // above the largest qlonglong
-        *out = QVariant(double(value.get_uint64().value_unsafe()));
-        return true;
+        number.integer = false;
+        number.real = double(value.get_uint64().value_unsafe());
+        return number;
     default:
         break;
     }
-    const double real = value.get_double().value_unsafe();
-    if (!std::isnormal(real)) {
-        // A written fraction or exponent that gives zero may have underflowed, which
-        // QJsonDocument refuses; subnormals it may round otherwise.
-        return false;
-    }
+    number.real = value.get_double().value_unsafe();
+    // A written fraction or exponent that gives zero may have underflowed, which QJsonDocument
+    // refuses; subnormals it may round otherwise.
+    number.ok = std::isnormal(number.real);
     // QJsonDocument keeps a number that has an exact 64-bit integer value as an integer.
     constexpr double twoTo63 = 9223372036854775808.0;
-    if (real >= -twoTo63 && real < twoTo63 && double(qlonglong(real)) == real) {
-        *out = QVariant(qlonglong(real));
-    } else {
-        *out = QVariant(real);
-    }
-    return true;
+    number.whole = number.real >= -twoTo63 && number.real < twoTo63 ? qlonglong(number.real) : 0;
+    number.integer = double(number.whole) == number.real;
+    return number;
 }
 
 bool toVariant(element value, QVariant* out)
@@ -69,6 +74,19 @@ bool toVariant(element value, QVariant* out)
         const simdjson::dom::array items = value.get_array().value_unsafe();
         list.reserve(qsizetype(items.size()));
         for (const element item : items) {
+            if (item.is_number()) {
+                // Feature vectors: numbers straight into the list, without a temporary.
+                const Number number = readNumber(item);
+                if (!number.ok) {
+                    return false;
+                }
+                if (number.integer) {
+                    list.emplaceBack(number.whole);
+                } else {
+                    list.emplaceBack(number.real);
+                }
+                continue;
+            }
             list.emplace_back();
             if (!toVariant(item, &list.back())) {
                 return false;
@@ -86,8 +104,11 @@ bool toVariant(element value, QVariant* out)
     case element_type::NULL_VALUE:
         *out = QVariant::fromValue(nullptr);
         return true;
-    default:
-        return number(value, out);
+    default: {
+        const Number number = readNumber(value);
+        *out = number.integer ? QVariant(number.whole) : QVariant(number.real);
+        return number.ok;
+    }
     }
 }
 

@@ -2,7 +2,6 @@
 // answers, found the way production finds it: through the machine setting "INSTALL_PATH", where
 // the 32-bit installer's key is read before the 64-bit one's.
 #include "DelvixKeys.h"
-#include "Faults.h"
 #include "HostFakes.h"
 #include "PluginDelvixSrv.h"
 #include "ReplyRecorder.h"
@@ -16,7 +15,6 @@
 #include <gtest/gtest.h>
 
 #include <set>
-#include <unistd.h>
 
 namespace {
 
@@ -140,26 +138,4 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
                                                {KEY_FACE_FEATURE, list(seeder.identityFace(identity))}});
     EXPECT_EQ(sightings(hits).size(), hits.size()); // no duplicates
     EXPECT_EQ(sightings(hits), expected);
-}
-
-// The mounts stay in a second process of this program: it runs the disabled test below.
-TEST(SearchEndToEndReadOnly, SearchesAnswerFromAReadOnlyStore)
-{
-    runDisabledTestInChild("SearchEndToEndTest.DISABLED_ReadOnlyStoreInThisProcess", 240000);
-}
-
-TEST_F(SearchEndToEndTest, DISABLED_ReadOnlyStoreInThisProcess)
-{
-    // The store folder becomes a read-only view of itself (chmod binds nobody when the tests run as root).
-    const std::string store = QDir(g_data->path()).filePath("Server").toStdString();
-    std::string reason = enterPrivateMountNamespace();
-    reason = reason.empty() ? bindReadOnly(store) : reason;
-    if (!reason.empty()) {
-        GTEST_SKIP() << reason;
-    }
-    ASSERT_NE(::access((store + "/tamsa.db").c_str(), W_OK), 0) << "the store is still writable";
-    EXPECT_EQ(run(CMD_START_SEARCH, {"Loc2"}).size(), 201u);
-    EXPECT_FALSE(
-        run(CMD_START_REID_SEARCH, {"Loc1", "Loc2"}, {{KEY_FEATURE, list(seeder.identityBody(identity))}})
-            .empty());
 }

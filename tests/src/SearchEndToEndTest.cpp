@@ -1,6 +1,7 @@
-// Both searches through Request over the real store library, seeded with synthetic camera
+// Re-identification through Request over the real store library, seeded with synthetic camera
 // answers, found the way production finds it: through the machine setting "INSTALL_PATH", where
-// the 32-bit installer's key is read before the 64-bit one's.
+// the 32-bit installer's key is read before the 64-bit one's. (The attribute search through
+// Request runs over a real store in SearchTest.)
 #include "DelvixKeys.h"
 #include "HostFakes.h"
 #include "PluginDelvixSrv.h"
@@ -104,23 +105,6 @@ protected:
 };
 
 } // namespace
-
-TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrderWithTheirImagesAndVectors)
-{
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc3"});
-    ASSERT_EQ(hits.size(), 201u);
-    std::set<QString> expected;
-    for (size_t i = 0; i < hits.size(); ++i) {
-        expected.insert(QString("Loc3/%1/camera-3").arg(i + 1)); // the camera's numbering
-        EXPECT_GE(hits[i].value(KEY_START_TIMESTAMP).toLongLong(),
-                  hits[i ? i - 1 : 0].value(KEY_START_TIMESTAMP).toLongLong());
-        EXPECT_FALSE(hits[i].value(KEY_OBJ_IMAGE).toString().isEmpty());
-        // People carry their body vector as the camera sent it.
-        const bool person = hits[i].value(KEY_OBJ_TYPE) == "Human";
-        EXPECT_EQ(hits[i].value(KEY_FEATURE).toList().size(), person ? 512 : 0);
-    }
-    EXPECT_EQ(sightings(hits), expected);
-}
 
 TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
 {

@@ -1,7 +1,7 @@
 #include "AttributeQueryWorker.h"
 
 #include "DelvixKeys.h"
-#include "JsonVariantParser.h"
+#include "JsonVariantReader.h"
 #include "LogFacility.h"
 #include "PlatformHelper.h"
 #include "ScopeTracer.h"
@@ -91,9 +91,8 @@ QVariant parseStoreJson(const char* text, AttributeQueryWorker::JsonRoute route)
     }
     const std::size_t length = std::strlen(text);
     if (route == AttributeQueryWorker::JsonRoute::Fast) {
-        bool ok = false;
-        QVariant tree = JsonVariantParser::parse(text, length, &ok);
-        if (ok) {
+        QVariant tree = JsonVariantReader::read(text, length);
+        if (tree.isValid()) {
             return tree;
         }
     }

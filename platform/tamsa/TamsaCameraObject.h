@@ -21,8 +21,8 @@ class TamsaCameraObject
 {
 public:
     // False when the element is not a valid object (missing member, wrong type, a number out of
-    // range, a feature that is not kFeatureDim finite floats); `out` is then unspecified.
-    static bool fromJson(const JsonValue& element, TamsaCameraObject* out);
+    // range, a feature that is not kFeatureDim floats); `out` is then unspecified.
+    static bool fromJson(simdjson::dom::element element, TamsaCameraObject* out);
 
     uint64_t m_id = 0;
     std::string m_type;

@@ -1,5 +1,7 @@
 #include "TamsaQuery.h"
 
+#include "JsonDom.h"
+
 #include <QList>
 #include <QString>
 
@@ -24,54 +26,58 @@ bool isAscii(std::string_view text)
     return true;
 }
 
+using simdjson::dom::element;
+using simdjson::dom::element_type;
+
 // Reads an attribute object; null and empty texts mean "no condition".
 bool readAttributes(const char* text, TamsaQuery* out)
 {
     if (!text || !*text) {
         return true;
     }
-    JsonValue object;
-    if (!JsonValue::parse(text, &object) || !object.isObject()) {
+    auto parser = std::make_shared<simdjson::dom::parser>();
+    element root;
+    simdjson::dom::object object;
+    if (JsonDom::parse(*parser, text, &root) || root.get_object().get(object)) {
         return false;
     }
-    for (size_t i = 0; i < object.keys.size(); ++i) {
-        out->m_attributeKeys.push_back(object.keys[i]);
-        out->m_attributeValues.push_back(std::move(object.values[i]));
+    for (const simdjson::dom::key_value_pair member : object) {
+        out->m_attributeKeys.emplace_back(member.key);
+        out->m_attributeValues.push_back(member.value);
     }
+    out->m_attributeTexts.push_back(std::move(parser));
     return true;
 }
 
-bool readPoint(const JsonValue& value, TrajectoryPoint* point)
+// [x, y] or {"x": x, "y": y}; the reader refuses non-finite numbers.
+bool readPoint(element value, TrajectoryPoint* point)
 {
-    if (value.isArray() && value.numberArray && value.numbers.size() == 2) {
-        point->x = value.numbers[0];
-        point->y = value.numbers[1];
-    } else if (value.isObject() && value.member("x") && value.member("y") && value.member("x")->isNumber() &&
-               value.member("y")->isNumber()) {
-        point->x = value.member("x")->number;
-        point->y = value.member("y")->number;
-    } else {
-        return false;
+    simdjson::dom::array pair;
+    if (!value.get_array().get(pair)) {
+        return pair.size() == 2 && !pair.at(0).get_double().get(point->x) &&
+               !pair.at(1).get_double().get(point->y);
     }
-    return std::isfinite(point->x) && std::isfinite(point->y);
+    return !value["x"].get_double().get(point->x) && !value["y"].get_double().get(point->y);
 }
 
-bool readFeature(const char* text, std::vector<float>* out)
+bool readFeature(simdjson::dom::parser& parser, const char* text, std::vector<float>* out)
 {
     if (!text || !*text) {
         return true;
     }
-    JsonValue array;
-    if (!JsonValue::parse(text, &array) || !array.isArray() || !array.numberArray ||
-        array.numbers.size() > kMaxFeatureLength) {
+    element root;
+    simdjson::dom::array numbers;
+    if (JsonDom::parse(parser, text, &root) || root.get_array().get(numbers) ||
+        numbers.size() > kMaxFeatureLength) {
         return false;
     }
-    out->reserve(array.numbers.size());
-    for (double number : array.numbers) {
-        if (!std::isfinite(number) || std::fabs(number) > 3.4e38) {
+    out->reserve(numbers.size());
+    for (element number : numbers) {
+        double value = 0;
+        if (number.get_double().get(value) || std::fabs(value) > 3.4e38) {
             return false;
         }
-        out->push_back(float(number));
+        out->push_back(float(value));
     }
     return true;
 }
@@ -121,19 +127,21 @@ bool insidePolygon(const TrajectoryPoint& p, const std::vector<TrajectoryPoint>&
 }
 
 // An object without a plate matches no pattern but the empty one (Tamsa.h).
-bool platePatternMatches(std::string_view plate, const std::string& pattern)
+bool platePatternMatches(std::string_view plate, std::string_view pattern)
 {
     return pattern.empty() || (!plate.empty() && wildcardContains(foldCase(plate), foldCase(pattern)));
 }
 
-bool matchesPlate(const JsonValue& query, std::string_view plate)
+bool matchesPlate(element query, std::string_view plate)
 {
-    if (query.isString()) {
-        return platePatternMatches(plate, query.text);
+    std::string_view pattern;
+    if (!query.get_string().get(pattern)) {
+        return platePatternMatches(plate, pattern);
     }
-    if (query.isArray()) {
-        for (size_t i = 0; i < query.items.size(); ++i) {
-            if (query.items[i].isString() && platePatternMatches(plate, query.items[i].text)) {
+    simdjson::dom::array patterns;
+    if (!query.get_array().get(patterns)) {
+        for (element item : patterns) {
+            if (!item.get_string().get(pattern) && platePatternMatches(plate, pattern)) {
                 return true;
             }
         }
@@ -142,11 +150,12 @@ bool matchesPlate(const JsonValue& query, std::string_view plate)
 }
 
 // A query scalar matches an equal object value, or a list holding an equal value.
-bool scalarMatches(const JsonValue& query, const JsonValue& object)
+bool scalarMatches(element query, element object)
 {
-    if (object.isArray()) {
-        for (size_t i = 0; i < object.arraySize(); ++i) {
-            if (jsonValuesEqual(query, object.arrayElement(i))) {
+    simdjson::dom::array list;
+    if (!object.get_array().get(list)) {
+        for (element item : list) {
+            if (jsonValuesEqual(query, item)) {
                 return true;
             }
         }
@@ -155,14 +164,15 @@ bool scalarMatches(const JsonValue& query, const JsonValue& object)
     return jsonValuesEqual(query, object);
 }
 
-bool memberMatches(const JsonValue& query, const JsonValue& object)
+bool memberMatches(element query, element object)
 {
-    if (!query.isArray()) {
+    simdjson::dom::array list;
+    if (query.get_array().get(list)) {
         return scalarMatches(query, object);
     }
     // A list matches when it shares at least one value with the object's value.
-    for (size_t i = 0; i < query.arraySize(); ++i) {
-        if (scalarMatches(query.arrayElement(i), object)) {
+    for (element item : list) {
+        if (scalarMatches(item, object)) {
             return true;
         }
     }
@@ -217,54 +227,60 @@ bool wildcardContains(const std::u32string& text, const std::u32string& pattern)
     return p == pattern.size();
 }
 
-bool jsonValuesEqual(const JsonValue& a, const JsonValue& b)
+bool jsonValuesEqual(element a, element b)
 {
-    if (a.type != b.type) {
+    if (a.is_number() && b.is_number()) {
+        return a.get_double().value_unsafe() == b.get_double().value_unsafe();
+    }
+    if (a.type() != b.type()) {
         return false;
     }
-    switch (a.type) {
-    case JsonValue::Type::Null:
+    switch (a.type()) {
+    case element_type::NULL_VALUE:
         return true;
-    case JsonValue::Type::Bool:
-        return a.boolean == b.boolean;
-    case JsonValue::Type::Number:
-        return a.number == b.number;
-    case JsonValue::Type::String:
-        if (a.text.size() == b.text.size() && isAscii(a.text) && isAscii(b.text)) {
-            for (size_t i = 0; i < a.text.size(); ++i) {
-                char x = a.text[i], y = b.text[i];
-                x = char(x >= 'A' && x <= 'Z' ? x + 32 : x);
-                y = char(y >= 'A' && y <= 'Z' ? y + 32 : y);
-                if (x != y) {
+    case element_type::BOOL:
+        return a.get_bool().value_unsafe() == b.get_bool().value_unsafe();
+    case element_type::STRING: {
+        const std::string_view x = a.get_string().value_unsafe();
+        const std::string_view y = b.get_string().value_unsafe();
+        if (x.size() == y.size() && isAscii(x) && isAscii(y)) {
+            for (size_t i = 0; i < x.size(); ++i) {
+                const char cx = char(x[i] >= 'A' && x[i] <= 'Z' ? x[i] + 32 : x[i]);
+                const char cy = char(y[i] >= 'A' && y[i] <= 'Z' ? y[i] + 32 : y[i]);
+                if (cx != cy) {
                     return false;
                 }
             }
             return true;
         }
-        return foldCase(a.text) == foldCase(b.text);
-    case JsonValue::Type::Array:
-        if (a.arraySize() != b.arraySize()) {
+        return foldCase(x) == foldCase(y);
+    }
+    case element_type::ARRAY: {
+        const simdjson::dom::array x = a.get_array().value_unsafe();
+        const simdjson::dom::array y = b.get_array().value_unsafe();
+        if (x.size() != y.size()) {
             return false;
         }
-        for (size_t i = 0; i < a.arraySize(); ++i) {
-            if (!jsonValuesEqual(a.arrayElement(i), b.arrayElement(i))) {
-                return false;
-            }
-        }
-        return true;
-    case JsonValue::Type::Object:
-        if (a.keys.size() != b.keys.size()) {
+        return std::equal(x.begin(), x.end(), y.begin(),
+                          [](element p, element q) { return jsonValuesEqual(p, q); });
+    }
+    case element_type::OBJECT: {
+        const simdjson::dom::object x = a.get_object().value_unsafe();
+        const simdjson::dom::object y = b.get_object().value_unsafe();
+        if (x.size() != y.size()) {
             return false;
         }
-        for (size_t i = 0; i < a.keys.size(); ++i) {
-            const JsonValue* other = b.member(a.keys[i]);
-            if (!other || !jsonValuesEqual(a.values[i], *other)) {
+        for (const simdjson::dom::key_value_pair member : x) {
+            element other;
+            if (y[member.key].get(other) || !jsonValuesEqual(member.value, other)) {
                 return false;
             }
         }
         return true;
     }
-    return false;
+    default:
+        return false; // numbers of either side alone
+    }
 }
 
 bool crossesLine(const TrajectoryPoint* points, size_t count, const TrajectoryPoint& a,
@@ -363,20 +379,20 @@ int32_t TamsaQuery::compile(const TTAMSA_OBJECTMETAINFO_QUERY& record, TamsaQuer
         out->m_hasPlate = true;
         out->m_plate = foldCase(record.pszPlateNumber);
     }
+    simdjson::dom::parser parser; // trace and vectors, read one after the other
     if (record.pszTrace && *record.pszTrace) {
-        JsonValue trace;
-        if (!JsonValue::parse(record.pszTrace, &trace) || !trace.isArray() || trace.arraySize() < 2) {
+        element root;
+        simdjson::dom::array trace;
+        if (JsonDom::parse(parser, record.pszTrace, &root) || root.get_array().get(trace) ||
+            trace.size() < 2) {
             return TAMSA_E_BAD_QUERY;
         }
-        for (size_t i = 0; i < trace.items.size(); ++i) {
+        for (element item : trace) {
             TrajectoryPoint point;
-            if (!readPoint(trace.items[i], &point)) {
-                return TAMSA_E_BAD_QUERY;
+            if (!readPoint(item, &point)) {
+                return TAMSA_E_BAD_QUERY; // a flat number list such as [1,2] is not a list of points
             }
             out->m_trace.push_back(point);
-        }
-        if (out->m_trace.size() < 2) {
-            return TAMSA_E_BAD_QUERY; // a flat number list such as [1,2] is not a list of points
         }
         if (out->m_trace.size() == 2 && (record.nDirection < 0 || record.nDirection > 2)) {
             return TAMSA_E_BAD_QUERY;
@@ -387,19 +403,25 @@ int32_t TamsaQuery::compile(const TTAMSA_OBJECTMETAINFO_QUERY& record, TamsaQuer
     out->m_direction = record.nDirection;
     out->m_descending = record.bDescending != 0;
     out->m_doNotSort = record.bDoNotSort != 0;
-    if (!readFeature(record.pszFeature, &out->m_body) || !readFeature(record.pszFaceFeature, &out->m_face)) {
+    if (!readFeature(parser, record.pszFeature, &out->m_body) ||
+        !readFeature(parser, record.pszFaceFeature, &out->m_face)) {
         return TAMSA_E_BAD_QUERY;
     }
     return TAMSA_OK;
 }
 
-bool TamsaQuery::matchesObject(const JsonValue& attributes, std::string_view plate,
+bool TamsaQuery::matchesObject(std::string_view attributes, std::string_view plate,
                                const TrajectoryPoint* trajectory, size_t pointCount, uint32_t startTime,
                                uint32_t endTime) const
 {
     if (m_hasPlate && !wildcardContains(foldCase(plate), m_plate)) {
         return false;
     }
+    element root;
+    simdjson::dom::object object;
+    // A damaged text matches no attribute condition.
+    const bool readable =
+        needsAttributes() && !JsonDom::parseSmall(attributes, &root) && !root.get_object().get(object);
     for (size_t i = 0; i < m_attributeKeys.size(); ++i) {
         if (m_attributeKeys[i] == "PlateNumber") {
             if (!matchesPlate(m_attributeValues[i], plate)) {
@@ -407,8 +429,9 @@ bool TamsaQuery::matchesObject(const JsonValue& attributes, std::string_view pla
             }
             continue;
         }
-        const JsonValue* value = attributes.member(m_attributeKeys[i]);
-        if (!value || !memberMatches(m_attributeValues[i], *value)) {
+        element value;
+        if (!readable || object[m_attributeKeys[i]].get(value) ||
+            !memberMatches(m_attributeValues[i], value)) {
             return false;
         }
     }

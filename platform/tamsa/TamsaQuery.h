@@ -4,8 +4,9 @@
 // each stored object.
 
 #include "Tamsa.h"
-#include "TamsaJson.h"
+#include <simdjson.h>
 
+#include <memory>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -25,8 +26,8 @@ public:
     static int32_t compile(const TTAMSA_OBJECTMETAINFO_QUERY& record, TamsaQuery* out);
 
     // The conditions that SQL does not check: attributes, plate and rule. `plate` is the object's
-    // plate text (empty when it has none), `attributes` its attribute object.
-    bool matchesObject(const JsonValue& attributes, std::string_view plate, const TrajectoryPoint* trajectory,
+    // plate text (empty when it has none), `attributes` its attribute object's text. Any thread.
+    bool matchesObject(std::string_view attributes, std::string_view plate, const TrajectoryPoint* trajectory,
                        size_t pointCount, uint32_t startTime, uint32_t endTime) const;
     // True when matchesObject needs the attribute object (parsing it can be skipped otherwise).
     bool needsAttributes() const { return !m_attributeKeys.empty(); }
@@ -37,7 +38,8 @@ public:
     std::vector<uint32_t> m_locations; // distinct, in the caller's order
     std::string m_objectType;          // empty: any type
     std::vector<std::string> m_attributeKeys;
-    std::vector<JsonValue> m_attributeValues;
+    std::vector<simdjson::dom::element> m_attributeValues; // in m_attributeTexts' documents
+    std::vector<std::shared_ptr<simdjson::dom::parser>> m_attributeTexts;
     std::u32string m_plate; // case-folded pattern; empty: no plate condition
     bool m_hasPlate = false;
     std::vector<TrajectoryPoint> m_trace;
@@ -55,7 +57,7 @@ std::u32string foldCase(std::string_view utf8);
 // Does `text` (folded) contain something matching `pattern` (folded; * any run, ? one character)?
 bool wildcardContains(const std::u32string& text, const std::u32string& pattern);
 // Attribute value equality: numbers numerically, texts case-insensitively, lists element-wise.
-bool jsonValuesEqual(const JsonValue& a, const JsonValue& b);
+bool jsonValuesEqual(simdjson::dom::element a, simdjson::dom::element b);
 
 // Rule checks, exposed for tests. Line: nDirection 0 either way, 1 negative->positive side,
 // 2 positive->negative. Zone: entered when a point lies inside or a segment crosses its border;

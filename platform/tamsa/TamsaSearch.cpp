@@ -265,14 +265,11 @@ bool TamsaSearch::rowMatches(sqlite3_stmt* statement) const
     if (!needsRow) {
         return true;
     }
-    JsonValue attributes;
-    if (m_query.needsAttributes()) {
-        JsonValue::parse(columnText(statement, ColAttributes), &attributes);
-    }
     const auto* points = static_cast<const TrajectoryPoint*>(sqlite3_column_blob(statement, ColTrajectory));
     const size_t pointCount =
         size_t(sqlite3_column_bytes(statement, ColTrajectory)) / sizeof(TrajectoryPoint);
-    return m_query.matchesObject(attributes, columnText(statement, ColPlate), points, points ? pointCount : 0,
+    return m_query.matchesObject(columnText(statement, ColAttributes), columnText(statement, ColPlate),
+                                 points, points ? pointCount : 0,
                                  uint32_t(sqlite3_column_int64(statement, ColStart)),
                                  uint32_t(sqlite3_column_int64(statement, ColEnd)));
 }

@@ -1,5 +1,6 @@
 #include "TamsaStore.h"
 
+#include "JsonDom.h"
 #include "Tamsa.h"
 #include "TamsaCameraObject.h"
 
@@ -265,23 +266,22 @@ int32_t TamsaStore::ingest(sqlite3* db, int32_t groupId, uint32_t location, std:
     if (location == 0) {
         return TAMSA_E_INVALID_ARGUMENT; // 0 ends location lists: no object can live there
     }
-    JsonValue document;
-    if (!JsonValue::parse(json, &document) || !document.isObject()) {
-        return TAMSA_E_BAD_JSON;
-    }
-    const JsonValue* list = document.member("ObjectMetaInfo");
-    if (!list || !list->isArray() || (list->numberArray && !list->numbers.empty())) {
-        return TAMSA_E_BAD_JSON;
-    }
     std::vector<TamsaCameraObject> objects;
-    objects.reserve(list->items.size());
-    for (const JsonValue& element : list->items) {
-        TamsaCameraObject object;
-        if (TamsaCameraObject::fromJson(element, &object)) {
-            objects.push_back(std::move(object));
+    {
+        simdjson::dom::parser parser; // freed with the parsed text, before writing
+        simdjson::dom::element document;
+        simdjson::dom::array list;
+        if (JsonDom::parse(parser, json, &document) || document["ObjectMetaInfo"].get_array().get(list)) {
+            return TAMSA_E_BAD_JSON;
+        }
+        objects.reserve(list.size());
+        for (const simdjson::dom::element element : list) {
+            TamsaCameraObject object;
+            if (TamsaCameraObject::fromJson(element, &object)) {
+                objects.push_back(std::move(object));
+            }
         }
     }
-    document = JsonValue(); // the parsed text is no longer needed; free it before writing
     if (objects.empty()) {
         return 0;
     }

@@ -1,8 +1,8 @@
-// Both searches through Request over the real store library, seeded with synthetic camera
+// Re-identification through Request over the real store library, seeded with synthetic camera
 // answers, found the way production finds it: through the machine setting "INSTALL_PATH", where
-// the 32-bit installer's key is read before the 64-bit one's.
+// the 32-bit installer's key is read before the 64-bit one's. (The attribute search through
+// Request runs over a real store in SearchTest.)
 #include "DelvixKeys.h"
-#include "Faults.h"
 #include "HostFakes.h"
 #include "PluginDelvixSrv.h"
 #include "ReplyRecorder.h"
@@ -16,7 +16,6 @@
 #include <gtest/gtest.h>
 
 #include <set>
-#include <unistd.h>
 
 namespace {
 
@@ -107,23 +106,6 @@ protected:
 
 } // namespace
 
-TEST_F(SearchEndToEndTest, AttributeSearchReturnsTheFirst201InTimeOrderWithTheirImagesAndVectors)
-{
-    const std::vector<QVariantMap> hits = run(CMD_START_SEARCH, {"Loc3"});
-    ASSERT_EQ(hits.size(), 201u);
-    std::set<QString> expected;
-    for (size_t i = 0; i < hits.size(); ++i) {
-        expected.insert(QString("Loc3/%1/camera-3").arg(i + 1)); // the camera's numbering
-        EXPECT_GE(hits[i].value(KEY_START_TIMESTAMP).toLongLong(),
-                  hits[i ? i - 1 : 0].value(KEY_START_TIMESTAMP).toLongLong());
-        EXPECT_FALSE(hits[i].value(KEY_OBJ_IMAGE).toString().isEmpty());
-        // People carry their body vector as the camera sent it.
-        const bool person = hits[i].value(KEY_OBJ_TYPE) == "Human";
-        EXPECT_EQ(hits[i].value(KEY_FEATURE).toList().size(), person ? 512 : 0);
-    }
-    EXPECT_EQ(sightings(hits), expected);
-}
-
 TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
 {
     std::set<QString> expected;
@@ -140,26 +122,4 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
                                                {KEY_FACE_FEATURE, list(seeder.identityFace(identity))}});
     EXPECT_EQ(sightings(hits).size(), hits.size()); // no duplicates
     EXPECT_EQ(sightings(hits), expected);
-}
-
-// The mounts stay in a second process of this program: it runs the disabled test below.
-TEST(SearchEndToEndReadOnly, SearchesAnswerFromAReadOnlyStore)
-{
-    runDisabledTestInChild("SearchEndToEndTest.DISABLED_ReadOnlyStoreInThisProcess", 240000);
-}
-
-TEST_F(SearchEndToEndTest, DISABLED_ReadOnlyStoreInThisProcess)
-{
-    // The store folder becomes a read-only view of itself (chmod binds nobody when the tests run as root).
-    const std::string store = QDir(g_data->path()).filePath("Server").toStdString();
-    std::string reason = enterPrivateMountNamespace();
-    reason = reason.empty() ? bindReadOnly(store) : reason;
-    if (!reason.empty()) {
-        GTEST_SKIP() << reason;
-    }
-    ASSERT_NE(::access((store + "/tamsa.db").c_str(), W_OK), 0) << "the store is still writable";
-    EXPECT_EQ(run(CMD_START_SEARCH, {"Loc2"}).size(), 201u);
-    EXPECT_FALSE(
-        run(CMD_START_REID_SEARCH, {"Loc1", "Loc2"}, {{KEY_FEATURE, list(seeder.identityBody(identity))}})
-            .empty());
 }

@@ -169,7 +169,7 @@ TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
 TEST_F(TamsaMatchingTest, ResultRecordCarriesEverythingStored)
 {
     ObjectSpec person{~0ull, "Human", 1000, 1010,
-                      R"({"Gender":1,"UpperColor":[2,5],"Name":"\ud800\udc00 \u00e9"})"};
+                      R"({"Gender":1,"UpperColor":[2,5],"Name":"\ud800\udc00 \u00e9 \"\\\/\n\u001f"})"};
     person.trajectory = {{0.25, 0.5}, {0.75, 0.125}};
     person.body = randomUnitVector(3), person.face = randomUnitVector(4), person.faceFiltered = true;
     ASSERT_EQ(put(9, {person}), 1);
@@ -216,18 +216,10 @@ TEST_F(TamsaLifecycleTest, ReingestReplacesWithoutDuplicates)
 
 TEST_F(TamsaLifecycleTest, BadIngestInputIsRefusedOrSkipped)
 {
-    const std::string deep = std::string(100000, '[') + std::string(100000, ']');
+    const std::string deep = std::string(100, '[') + std::string(100, ']'); // beyond the store's 64
     for (const std::string& text :
          {std::string("not json"), std::string("[]"), std::string(R"({"ObjectMetaInfo":{}})"), deep}) {
         EXPECT_EQ(putText(1, text), TAMSA_E_BAD_JSON) << text.substr(0, 20);
-    }
-    // A text that is not UTF-8 makes the answer unreadable, as it would be to any reader of the texts
-    // the store hands out: a stray continuation byte, a cut sequence, overlong forms, an encoded
-    // surrogate, beyond U+10FFFF, bytes UTF-8 never uses, and a bad escape.
-    for (const char* text : {"\x97", "\xC7 ", "\xE4\xBA", "\xC0\xAF", "\xE0\x80\xAF", "\xED\xA0\x80",
-                             "\xF4\x90\x80\x80", "\xF8\x88\x80\x80\x80", "\xFF", "\\u12", "\\q"}) {
-        EXPECT_EQ(put(1, {{3, "Human", 1, 2, std::string(R"({"Age":")") + text + "\"}"}}), TAMSA_E_BAD_JSON)
-            << text;
     }
     EXPECT_EQ(putText(0, R"({"ObjectMetaInfo":[]})"), TAMSA_E_INVALID_ARGUMENT);
 

@@ -251,11 +251,18 @@ std::string TamsaStore::infoPath(uint32_t location, FeatureKind kind) const
            (kind == FeatureKind::Body ? ".body" : ".face") + ".rows";
 }
 
+std::string TamsaStore::compactPath(uint32_t location, FeatureKind kind) const
+{
+    return m_directory + "/features/L" + std::to_string(location) +
+           (kind == FeatureKind::Body ? ".body" : ".face") + ".q8";
+}
+
 TamsaFeatureFile* TamsaStore::writer(uint32_t location, FeatureKind kind)
 {
     std::unique_ptr<TamsaFeatureFile>& file = m_writers[{location, int(kind)}];
     if (!file) {
-        file.reset(new TamsaFeatureFile(vectorPath(location, kind), infoPath(location, kind)));
+        file.reset(new TamsaFeatureFile(vectorPath(location, kind), infoPath(location, kind),
+                                        compactPath(location, kind)));
     }
     return file.get();
 }
@@ -371,13 +378,18 @@ std::shared_ptr<const TamsaFeatureMap> TamsaStore::featureMap(uint32_t location,
 {
     const std::string vectors = vectorPath(location, kind);
     const std::string infos = infoPath(location, kind);
+    const std::string compact = compactPath(location, kind);
     std::lock_guard<std::mutex> lock(m_mapMutex);
     std::shared_ptr<const TamsaFeatureMap>& cached = m_maps[{location, int(kind)}];
+    // A view whose compact rows lag (a store from before them) is renewed once a writer has
+    // filled them in.
     if (cached && cached->rows() >= needRows &&
-        cached->rows() == TamsaFeatureMap::rowsOnDisk(vectors, infos)) {
+        cached->rows() == TamsaFeatureMap::rowsOnDisk(vectors, infos) &&
+        (cached->compactRows() == cached->rows() ||
+         cached->compactRows() == std::min(cached->rows(), TamsaFeatureMap::compactRowsOnDisk(compact)))) {
         return cached;
     }
-    cached = TamsaFeatureMap::map(vectors, infos, cached);
+    cached = TamsaFeatureMap::map(vectors, infos, compact, cached);
     return cached;
 }
 

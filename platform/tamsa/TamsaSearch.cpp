@@ -6,6 +6,7 @@
 #include <sqlite3.h>
 
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
 #include <thread>
 
@@ -39,8 +40,13 @@ constexpr int64_t kScanChunkRows = 2048;
 constexpr int64_t kParallelScanRows = 32768;
 
 std::atomic<bool> g_compactScan{true};
-std::atomic<int64_t> g_scannedRows{0};
-std::atomic<int64_t> g_float32Rows{0};
+
+// TAMSA_SCAN=float32 turns the compact copy off, read at every scan (benchmarks compare both ways).
+bool compactScanWanted()
+{
+    const char* mode = std::getenv("TAMSA_SCAN");
+    return g_compactScan.load(std::memory_order_relaxed) && !(mode && std::strcmp(mode, "float32") == 0);
+}
 
 int progressHandler(void* search)
 {
@@ -306,11 +312,6 @@ void TamsaSearch::setCompactScan(bool enabled)
     g_compactScan.store(enabled, std::memory_order_relaxed);
 }
 
-TamsaSearch::ScanCounts TamsaSearch::scanCounts()
-{
-    return {g_scannedRows.load(std::memory_order_relaxed), g_float32Rows.load(std::memory_order_relaxed)};
-}
-
 int32_t TamsaSearch::runScan()
 {
     struct Task
@@ -334,7 +335,7 @@ int32_t TamsaSearch::runScan()
         }
         float dot = 0;
         dotNormScalar()(query.data(), query.data(), query.size(), &dot, &queryNorm2[kind]);
-        if (g_compactScan.load(std::memory_order_relaxed)) {
+        if (compactScanWanted()) {
             encodeCompactQuery(query, kScoreThreshold, &compactQueries[size_t(kind)]);
         }
         for (uint32_t location : m_query.m_locations) {
@@ -370,7 +371,6 @@ int32_t TamsaSearch::runScan()
     const CompactDotFn compactKernel = compactDotBest();
     std::atomic<size_t> nextTask{0};
     auto work = [&](std::vector<RawHit>* hits) {
-        int64_t float32Rows = 0;
         for (size_t t = nextTask++; t < tasks.size() && !aborted(); t = nextTask++) {
             const Task& task = tasks[t];
             const std::vector<float>& query = *queries[int(task.kind)];
@@ -391,16 +391,13 @@ int32_t TamsaSearch::runScan()
                 float dot = 0;
                 float norm2 = 0;
                 kernel(query.data(), task.map->vector(row), query.size(), &dot, &norm2);
-                ++float32Rows;
                 const float cosine = cosineFromParts(dot, qn2, norm2);
                 if (cosine >= kScoreThreshold) {
                     hits->push_back({info.objectRowId, task.location, int(task.kind), row, cosine});
                 }
             }
         }
-        g_float32Rows += float32Rows;
     };
-    g_scannedRows += totalRows;
     const unsigned threadCount =
         totalRows >= kParallelScanRows ? std::max(1u, std::min(4u, std::thread::hardware_concurrency())) : 1u;
     std::vector<std::vector<RawHit>> perThread(threadCount);

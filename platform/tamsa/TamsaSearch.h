@@ -36,16 +36,9 @@ public:
 
     int32_t next(TTAMSA_OBJECTMETAINFO_RESULT* result);
     // Whether feature scans may rule rows out by their compact copy (the default); off, every
-    // row is scored in float32. The results are the same either way; benchmarks and tests
-    // compare the two.
+    // row is scored in float32 (so also with TAMSA_SCAN=float32 in the environment). The results
+    // are the same either way; benchmarks and tests compare the two.
     static void setCompactScan(bool enabled);
-    // Rows of feature scans in this process so far: read in the window, and scored in float32.
-    struct ScanCounts
-    {
-        int64_t rows = 0;
-        int64_t float32Rows = 0;
-    };
-    static ScanCounts scanCounts();
     void abort() { m_aborted.store(true, std::memory_order_relaxed); }
     bool aborted() const { return m_aborted.load(std::memory_order_relaxed); }
 

@@ -256,7 +256,7 @@ double compactScanRate(const ScanSet& set, unsigned threads, int64_t* float32Row
     const std::vector<float> query = tamsa::TamsaSeeder(g_options).identityBody(0);
     tamsa::CompactQuery compact;
     tamsa::encodeCompactQuery(query, 0.5f, &compact);
-    const tamsa::CompactDotFn kernel = tamsa::compactDotBest();
+    const tamsa::CompactFilterFn filter = tamsa::compactFilterBest();
     const tamsa::DotNormFn floatKernel = tamsa::dotNormBest();
     std::atomic<size_t> nextMap{0};
     std::atomic<int64_t> rescored{0};
@@ -264,13 +264,16 @@ double compactScanRate(const ScanSet& set, unsigned threads, int64_t* float32Row
     auto work = [&] {
         int64_t scored = 0;
         int found = 0;
+        std::vector<uint32_t> kept(2048);
         for (size_t m = nextMap++; m < set.maps.size(); m = nextMap++) {
             const tamsa::TamsaFeatureMap& map = *set.maps[m];
-            for (int64_t row = 0; row < map.compactRows(); ++row) {
-                const tamsa::CompactRow& r = map.compact(row);
-                if (tamsa::compactMayReach(compact, r, kernel(compact, r))) {
+            for (int64_t first = 0; first < map.compactRows(); first += 2048) {
+                const size_t count =
+                    filter(compact, &map.compact(first),
+                           size_t(std::min<int64_t>(2048, map.compactRows() - first)), kept.data());
+                for (size_t k = 0; k < count; ++k) {
                     float dot = 0, norm2 = 0;
-                    floatKernel(query.data(), map.vector(row), query.size(), &dot, &norm2);
+                    floatKernel(query.data(), map.vector(first + kept[k]), query.size(), &dot, &norm2);
                     ++scored;
                     found += tamsa::cosineFromParts(dot, 1.0f, norm2) >= 0.5f;
                 }

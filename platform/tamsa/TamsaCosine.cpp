@@ -117,6 +117,16 @@ int32_t compactDotPlain(const CompactQuery& query, const CompactRow& row)
     return dot;
 }
 
+size_t compactFilterPlain(const CompactQuery& query, const CompactRow* rows, size_t count, uint32_t* kept)
+{
+    size_t n = 0;
+    for (size_t i = 0; i < count; ++i) {
+        kept[n] = uint32_t(i);
+        n += compactMayReach(query, rows[i], compactDotPlain(query, rows[i]));
+    }
+    return n;
+}
+
 #ifdef TAMSA_X86
 __attribute__((target("avx2"))) int32_t intLaneSum(__m256i sum)
 {
@@ -161,11 +171,34 @@ __attribute__((target("avx2,avx512f,avx512bw,avx512vnni"))) int32_t compactDotVn
                                        _mm512_maskz_extracti64x4_epi64(0xFF, sum, 1))) -
            128 * row.codeSum;
 }
+
+__attribute__((target("avx2"))) size_t compactFilterAvx2(const CompactQuery& query, const CompactRow* rows,
+                                                         size_t count, uint32_t* kept)
+{
+    size_t n = 0;
+    for (size_t i = 0; i < count; ++i) {
+        kept[n] = uint32_t(i);
+        n += compactMayReach(query, rows[i], compactDotAvx2(query, rows[i]));
+    }
+    return n;
+}
+
+__attribute__((target("avx2,avx512f,avx512bw,avx512vnni"))) size_t
+compactFilterVnni(const CompactQuery& query, const CompactRow* rows, size_t count, uint32_t* kept)
+{
+    size_t n = 0;
+    for (size_t i = 0; i < count; ++i) {
+        kept[n] = uint32_t(i);
+        n += compactMayReach(query, rows[i], compactDotVnni(query, rows[i]));
+    }
+    return n;
+}
 #endif
 
 struct CompactChoice
 {
     CompactDotFn fn;
+    CompactFilterFn filter;
     const char* name;
 };
 
@@ -175,13 +208,13 @@ const CompactChoice& compactBest()
 #ifdef TAMSA_X86
         __builtin_cpu_init();
         if (__builtin_cpu_supports("avx512vnni") && __builtin_cpu_supports("avx512bw")) {
-            return CompactChoice{compactDotVnni, "avx512vnni"};
+            return CompactChoice{compactDotVnni, compactFilterVnni, "avx512vnni"};
         }
         if (__builtin_cpu_supports("avx2")) {
-            return CompactChoice{compactDotAvx2, "avx2"};
+            return CompactChoice{compactDotAvx2, compactFilterAvx2, "avx2"};
         }
 #endif
-        return CompactChoice{compactDotPlain, "scalar"};
+        return CompactChoice{compactDotPlain, compactFilterPlain, "scalar"};
     }();
     return choice;
 }
@@ -334,6 +367,11 @@ CompactDotFn compactDotScalar()
 CompactDotFn compactDotBest()
 {
     return compactBest().fn;
+}
+
+CompactFilterFn compactFilterBest()
+{
+    return compactBest().filter;
 }
 
 const char* compactDotBestName()

@@ -66,4 +66,10 @@ inline bool compactMayReach(const CompactQuery& query, const CompactRow& row, in
            query.limit;
 }
 
+// The scan's inner loop: writes to `kept` the indexes of the rows among `count` that
+// compactMayReach keeps, and returns how many (one call per chunk, the dot product inlined).
+using CompactFilterFn = size_t (*)(const CompactQuery& query, const CompactRow* rows, size_t count,
+                                   uint32_t* kept);
+CompactFilterFn compactFilterBest();
+
 } // namespace tamsa

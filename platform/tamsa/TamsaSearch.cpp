@@ -368,25 +368,18 @@ int32_t TamsaSearch::runScan()
     }
 
     const DotNormFn kernel = dotNormBest();
-    const CompactDotFn compactKernel = compactDotBest();
+    const CompactFilterFn compactFilter = compactFilterBest();
     std::atomic<size_t> nextTask{0};
     auto work = [&](std::vector<RawHit>* hits) {
+        std::vector<uint32_t> kept(static_cast<size_t>(kScanChunkRows));
         for (size_t t = nextTask++; t < tasks.size() && !aborted(); t = nextTask++) {
             const Task& task = tasks[t];
             const std::vector<float>& query = *queries[int(task.kind)];
             const float qn2 = queryNorm2[int(task.kind)];
-            const CompactQuery& compactQuery = compactQueries[size_t(task.kind)];
-            const int64_t compactEnd = compactQuery.usable ? std::min(task.end, task.map->compactRows()) : 0;
-            for (int64_t row = task.begin; row < task.end; ++row) {
+            auto scoreRow = [&](int64_t row) {
                 const FeatureRowInfo& info = task.map->info(row);
                 if (info.startTime > m_query.m_endTime || info.endTime < m_query.m_startTime) {
-                    continue;
-                }
-                if (row < compactEnd) {
-                    const CompactRow& compact = task.map->compact(row);
-                    if (!compactMayReach(compactQuery, compact, compactKernel(compactQuery, compact))) {
-                        continue;
-                    }
+                    return;
                 }
                 float dot = 0;
                 float norm2 = 0;
@@ -395,6 +388,21 @@ int32_t TamsaSearch::runScan()
                 if (cosine >= kScoreThreshold) {
                     hits->push_back({info.objectRowId, task.location, int(task.kind), row, cosine});
                 }
+            };
+            // Rows with a compact copy are scored in float32 only when it cannot rule them out.
+            const CompactQuery& compactQuery = compactQueries[size_t(task.kind)];
+            const int64_t compactEnd = compactQuery.usable
+                                           ? std::max(task.begin, std::min(task.end, task.map->compactRows()))
+                                           : task.begin;
+            const size_t count = compactEnd > task.begin
+                                     ? compactFilter(compactQuery, &task.map->compact(task.begin),
+                                                     size_t(compactEnd - task.begin), kept.data())
+                                     : 0;
+            for (size_t k = 0; k < count; ++k) {
+                scoreRow(task.begin + int64_t(kept[k]));
+            }
+            for (int64_t row = compactEnd; row < task.end; ++row) {
+                scoreRow(row);
             }
         }
     };

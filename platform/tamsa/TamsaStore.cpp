@@ -232,6 +232,11 @@ sqlite3* TamsaStore::connect(int32_t* status) const
         }
     }
     sqlite3_busy_timeout(db, 30000);
+    // With a persistent log, SQLite empties it after the last connection's checkpoint only when a
+    // size limit is set; without one every later last close (each handle of the plug-in) copied
+    // the same frames into the database again, for milliseconds per handle. The limit itself only
+    // bounds what the log keeps between checkpoints.
+    exec(db, "PRAGMA journal_size_limit=67108864");
     exec(db, m_fullSync ? "PRAGMA synchronous=FULL" : "PRAGMA synchronous=NORMAL");
     exec(db, "PRAGMA temp_store=MEMORY");
     exec(db, "PRAGMA cache_size=-65536");

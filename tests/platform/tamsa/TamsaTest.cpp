@@ -617,4 +617,13 @@ TEST_F(TamsaCompactScanTest, TimeWindowScanFindsLateAndLongObjects)
     EXPECT_EQ(got, expected);
 }
 
+// The last handle to go empties the log: otherwise every later handle's close copied the same
+// frames into the database again.
+TEST_F(TamsaCompactScanTest, LastHandleLeavesAnEmptyLog)
+{
+    ASSERT_EQ(put(1, numberedObjects(1, 50)), 50);
+    Tamsa_ReleaseDatabase(&m_database);
+    EXPECT_EQ(std::filesystem::file_size(storagePath() + "/tamsa.db-wal"), 0u);
+}
+
 } // namespace

@@ -27,6 +27,7 @@
 #include <algorithm>
 #include <condition_variable>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <ctime>
 #include <mutex>
@@ -378,7 +379,10 @@ void BM_StartReIdSearchSeeded(benchmark::State& state)
                              {KEY_END_TIMESTAMP, start + qint64(g_seeded.options.spanSeconds) * 1000},
                              {KEY_FEATURE, asList(seeder.identityBody(identity))},
                              {KEY_FACE_FEATURE, asList(seeder.identityFace(identity))}};
+    // The store's float32 scan or its compact one (the plug-in loads the store into this process).
+    ::setenv("TAMSA_SCAN", state.range(0) ? "compact" : "float32", 1);
     runSeeded(state, CMD_START_REID_SEARCH, params, 1);
+    ::setenv("TAMSA_SCAN", "compact", 1);
 }
 
 } // namespace
@@ -421,6 +425,9 @@ int main(int argc, char** argv)
             ->Unit(benchmark::kMillisecond)
             ->UseRealTime();
         benchmark::RegisterBenchmark("BM_StartReIdSearchSeeded", BM_StartReIdSearchSeeded)
+            ->ArgName("compact")
+            ->Arg(0)
+            ->Arg(1)
             ->Unit(benchmark::kMillisecond)
             ->UseRealTime();
     }

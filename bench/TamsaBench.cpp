@@ -1,14 +1,21 @@
 // The object-metadata store against its performance targets:
 //   - attribute query (one location, one hour, a gender and a colour condition): First + 201 records
-//   - cosine scan against the memory read bandwidth measured in the same run (printed with the ratio)
-//   - feature search over every location's people
-//   - ingest rate of camera answers; seeding time and disk size
+//   - cosine scan against the memory read bandwidth measured in the same run (printed with the ratio),
+//     and the compact (int8) scan against the float32 scan, in rows per second; fp16 for comparison
+//   - feature search over every location's people, with and without the compact copy
+//   - re-identification (body and face) over the last hour and over the whole span; the whole span
+//     once on a cold page cache (the store's files evicted first), then warm
+//   - ingest rate of camera answers; seeding time and disk size (the compact copy's share apart);
+//     the memory the process holds at the end
 //
 // Environment:
 //   TAMSA_BENCH_OBJECTS (default 20000), TAMSA_BENCH_LOCATIONS (default 10), TAMSA_BENCH_SEED (1):
 //       what the store holds (and what the benchmark seeds when it makes its own store)
+//   TAMSA_BENCH_SPAN_DAYS (default: the seeder's few hours): the time each location's objects span
 //   TAMSA_BENCH_STORE=DIR: use (or make once) the store in DIR instead of a temporary folder; a store
 //       made by `delvix-host seed --data D ...` is D/Server, seeded with the same three values.
+//   TAMSA_BENCH_SCALE=1: the scale run (`./run bench-scale`): leaves out the scan-rate report and the
+//       ingest benchmark, whose float32 passes over a store larger than memory would take hours.
 #include "Tamsa.h"
 #include "TamsaCosine.h"
 #include "TamsaFeatureFile.h"
@@ -25,7 +32,10 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cmath>
 #include <cstring>
+#include <fcntl.h>
+#include <fstream>
 #include <immintrin.h>
 #include <memory>
 #include <thread>
@@ -60,15 +70,44 @@ void* openDatabase(const std::string& path)
     return database;
 }
 
-qint64 folderBytes(const QString& path)
+// Bytes of the files under `path` whose names end in `suffix` (all files for an empty one).
+qint64 folderBytes(const QString& path, const QString& suffix = QString())
 {
     qint64 total = 0;
     QDirIterator it(path, QDir::Files, QDirIterator::Subdirectories);
     while (it.hasNext()) {
         it.next();
-        total += it.fileInfo().size();
+        total += it.fileName().endsWith(suffix) ? it.fileInfo().size() : 0;
     }
     return total;
+}
+
+void reportDisk()
+{
+    const QString store = QString::fromStdString(g_storePath);
+    const double f32 = double(folderBytes(store, ".f32")), rows = double(folderBytes(store, ".rows"));
+    const double q8 = double(folderBytes(store, ".q8"));
+    std::printf("disk: %.3f GB in all; float32 vectors %.3f GB, row records %.3f GB, compact copy %.3f GB "
+                "= %.1f%% of the float32 files\n",
+                double(folderBytes(store)) / 1e9, f32 / 1e9, rows / 1e9, q8 / 1e9, 100.0 * q8 / (f32 + rows));
+}
+
+// What this process holds, from /proc/self/status (file pages: the mapped store).
+void reportMemory(const char* when)
+{
+    std::ifstream status("/proc/self/status");
+    std::string name;
+    double kB = 0, resident = 0, file = 0, peak = 0;
+    while (status >> name) {
+        if (name == "VmHWM:" || name == "VmRSS:" || name == "RssFile:") {
+            status >> kB;
+            (name == "VmHWM:" ? peak : name == "VmRSS:" ? resident : file) = kB / 1048576.0;
+        }
+    }
+    std::printf(
+        "memory held %s: resident %.2f GiB (store files mapped %.2f GiB, own %.2f GiB), peak %.2f GiB\n",
+        when, resident, file, resident - file, peak);
+    std::fflush(stdout);
 }
 
 bool prepareStore()
@@ -76,6 +115,9 @@ bool prepareStore()
     g_options.objects = envNumber("TAMSA_BENCH_OBJECTS", 20000);
     g_options.locations = uint32_t(envNumber("TAMSA_BENCH_LOCATIONS", 10));
     g_options.seed = uint32_t(envNumber("TAMSA_BENCH_SEED", 1));
+    g_options.spanSeconds = uint32_t(envNumber("TAMSA_BENCH_SPAN_DAYS", 0) * 86400);
+    g_options.spanSeconds =
+        g_options.spanSeconds ? g_options.spanSeconds : tamsa::TamsaSeedOptions().spanSeconds;
     if (const char* path = std::getenv("TAMSA_BENCH_STORE")) {
         g_storePath = path;
     } else {
@@ -104,6 +146,7 @@ bool prepareStore()
                     (unsigned long long)g_options.objects, g_options.locations, g_options.seed);
     }
     Tamsa_ReleaseDatabase(&database);
+    reportDisk();
     return true;
 }
 
@@ -207,6 +250,141 @@ double scanRate(const ScanSet& set, unsigned threads, tamsa::DotNormFn kernel, i
     return best;
 }
 
+// The compact scan as the search runs it: int8 scores rule rows out, the rest are scored in
+// float32; rows per second. *float32Rows gets the rows that needed their float32 score.
+double compactScanRate(const ScanSet& set, unsigned threads, int64_t* float32Rows)
+{
+    const std::vector<float> query = tamsa::TamsaSeeder(g_options).identityBody(0);
+    tamsa::CompactQuery compact;
+    tamsa::encodeCompactQuery(query, 0.5f, &compact);
+    const tamsa::CompactFilterFn filter = tamsa::compactFilterBest();
+    const tamsa::DotNormFn floatKernel = tamsa::dotNormBest();
+    std::atomic<size_t> nextMap{0};
+    std::atomic<int64_t> rescored{0};
+    const auto begin = std::chrono::steady_clock::now();
+    auto work = [&] {
+        int64_t scored = 0;
+        int found = 0;
+        std::vector<uint32_t> kept(2048);
+        for (size_t m = nextMap++; m < set.maps.size(); m = nextMap++) {
+            const tamsa::TamsaFeatureMap& map = *set.maps[m];
+            for (int64_t first = 0; first < map.compactRows(); first += 2048) {
+                const size_t count =
+                    filter(compact, &map.compact(first),
+                           size_t(std::min<int64_t>(2048, map.compactRows() - first)), kept.data());
+                for (size_t k = 0; k < count; ++k) {
+                    float dot = 0, norm2 = 0;
+                    floatKernel(query.data(), map.vector(first + kept[k]), query.size(), &dot, &norm2);
+                    ++scored;
+                    found += tamsa::cosineFromParts(dot, 1.0f, norm2) >= 0.5f;
+                }
+            }
+        }
+        benchmark::DoNotOptimize(found);
+        rescored += scored;
+    };
+    std::vector<std::thread> workers;
+    for (unsigned t = 1; t < threads; ++t) {
+        workers.emplace_back(work);
+    }
+    work();
+    for (std::thread& worker : workers) {
+        worker.join();
+    }
+    *float32Rows = rescored;
+    return double(set.rows) / seconds(std::chrono::steady_clock::now() - begin);
+}
+
+__attribute__((target("avx512f,f16c"))) float halfDot(const float* q, const uint16_t* h)
+{
+    __m512 a0 = _mm512_setzero_ps(), a1 = _mm512_setzero_ps();
+    for (size_t i = 0; i < tamsa::kFeatureDim; i += 32) {
+        _mm_prefetch(reinterpret_cast<const char*>(h + i) + 4096, _MM_HINT_T0);
+        a0 = _mm512_fmadd_ps(
+            _mm512_loadu_ps(q + i),
+            _mm512_maskz_cvtph_ps(0xFFFF, _mm256_loadu_si256(reinterpret_cast<const __m256i*>(h + i))), a0);
+        a1 = _mm512_fmadd_ps(
+            _mm512_loadu_ps(q + i + 16),
+            _mm512_maskz_cvtph_ps(0xFFFF, _mm256_loadu_si256(reinterpret_cast<const __m256i*>(h + i + 16))),
+            a1);
+    }
+    alignas(64) float lanes[16];
+    _mm512_store_ps(lanes, _mm512_add_ps(a0, a1));
+    float dot = 0;
+    for (float lane : lanes) {
+        dot += lane;
+    }
+    return dot;
+}
+
+// The alternative copy measured against int8: fp16 rows (1024 bytes each), widened to float32
+// and multiplied with a float query. Rows per second over `rows` rows (a copy made for this).
+__attribute__((target("f16c"))) double halfScanRate(const ScanSet& set, size_t rows, unsigned threads)
+{
+    static std::vector<uint16_t> halves;
+    const std::vector<float> query = tamsa::TamsaSeeder(g_options).identityBody(0);
+    if (halves.size() != rows * tamsa::kFeatureDim) {
+        halves.resize(rows * tamsa::kFeatureDim);
+        size_t row = 0;
+        for (size_t m = 0; m < set.maps.size() && row < rows; ++m) {
+            for (int64_t r = 0; r < set.maps[m]->rows() && row < rows; ++r, ++row) {
+                const float* vector = set.maps[m]->vector(r);
+                for (size_t i = 0; i < tamsa::kFeatureDim; ++i) {
+                    halves[row * tamsa::kFeatureDim + i] = _cvtss_sh(vector[i], 0);
+                }
+            }
+        }
+    }
+    std::atomic<int> hits{0};
+    const auto begin = std::chrono::steady_clock::now();
+    auto work = [&](size_t first, size_t last) {
+        int found = 0;
+        for (size_t row = first; row < last; ++row) {
+            found += halfDot(query.data(), halves.data() + row * tamsa::kFeatureDim) >= 0.5f;
+        }
+        hits += found;
+    };
+    std::vector<std::thread> workers;
+    for (unsigned t = 1; t < threads; ++t) {
+        workers.emplace_back(work, rows * t / threads, rows * (t + 1) / threads);
+    }
+    work(0, rows / threads);
+    for (std::thread& worker : workers) {
+        worker.join();
+    }
+    return double(rows) / seconds(std::chrono::steady_clock::now() - begin);
+}
+
+void reportCompactAgainstFloat(const ScanSet& set)
+{
+    const unsigned cores = std::max(1u, std::thread::hardware_concurrency());
+    double floatRows = 0, compactRows = 0, halfRows = 0, int8Rows = 0;
+    int64_t rescored = 0;
+    ScanSet first; // the rows the fp16 copy holds (a few hundred MB), for int8 on the same rows
+    for (size_t m = 0; m < set.maps.size() && first.rows < 300000; ++m) {
+        first.maps.push_back(set.maps[m]);
+        first.rows += size_t(set.maps[m]->rows());
+    }
+    const size_t sample = first.rows;
+    for (int pass = 0; pass < 7; ++pass) {
+        floatRows =
+            std::max(floatRows, scanRate(set, cores, tamsa::dotNormBest()) * 1e9 / tamsa::kFeatureRowBytes);
+        compactRows = std::max(compactRows, compactScanRate(set, cores, &rescored));
+        halfRows = std::max(halfRows, halfScanRate(set, sample, cores));
+        int64_t ignored = 0;
+        int8Rows = std::max(int8Rows, compactScanRate(first, cores, &ignored));
+    }
+    std::printf("  %u thread(s): float32 scan %.1f M rows/s; compact scan (int8, kernel %s) %.1f M rows/s = "
+                "%.2fx the float32 scan, %lld of %zu rows scored in float32 too\n",
+                cores, floatRows / 1e6, tamsa::compactDotBestName(), compactRows / 1e6,
+                compactRows / floatRows, (long long)rescored, set.rows);
+    std::printf(
+        "  copies compared on %zu rows: int8 %.1f M rows/s (528 bytes a row), fp16 %.1f M rows/s (1024 "
+        "bytes a row) = %.2fx int8\n\n",
+        first.rows, int8Rows / 1e6, halfRows / 1e6, halfRows / int8Rows);
+    std::fflush(stdout);
+}
+
 void reportScanAgainstBandwidth()
 {
     const ScanSet set = bodyMaps();
@@ -236,8 +414,7 @@ void reportScanAgainstBandwidth()
             break;
         }
     }
-    std::printf("\n");
-    std::fflush(stdout);
+    reportCompactAgainstFloat(set);
 }
 
 // ---- searches ---------------------------------------------------------------------------------
@@ -273,8 +450,13 @@ void BM_AttributeQueryFirst201(benchmark::State& state)
     Search s;
     std::memset(&s.query, 0, sizeof s.query);
     s.query.wSize = sizeof s.query;
+    // An hour at the targets' size (2,500 objects an hour in a location); a store whose locations
+    // see fewer an hour (the scale run's 30 days) gets as many hours as hold that many.
+    const double perHour = double(g_options.objects) / std::max(1u, g_options.locations) * 3600.0 /
+                           std::max(1u, g_options.spanSeconds);
+    const uint32_t hours = uint32_t(std::max(1.0, std::ceil(2500.0 / std::max(1.0, perHour))));
     s.query.dwStartTime = g_options.firstTime + 3600;
-    s.query.dwEndTime = g_options.firstTime + 7200;
+    s.query.dwEndTime = g_options.firstTime + 3600 * (1 + hours);
     s.locations = {1, 0};
     s.query.pdwLocationIds = s.locations.data();
     s.query.pszObjectType = "Human";
@@ -290,42 +472,103 @@ void BM_AttributeQueryFirst201(benchmark::State& state)
     Tamsa_ReleaseDatabase(&database);
 }
 
-void BM_FeatureSearchAllLocations(benchmark::State& state)
+std::string vectorText(const std::vector<float>& vector)
+{
+    std::string out = "[";
+    char buffer[32];
+    for (size_t i = 0; i < vector.size(); ++i) {
+        out += (i ? "," : "") +
+               std::string(buffer, size_t(std::snprintf(buffer, sizeof buffer, "%.7g", vector[i])));
+    }
+    return out + "]";
+}
+
+// A feature search over every location: people by body (and face), in [start, end].
+struct FeatureSearch : Search
+{
+    FeatureSearch(bool withFace, uint32_t start, uint32_t end)
+    {
+        const tamsa::TamsaSeeder seeder(g_options);
+        std::memset(&query, 0, sizeof query);
+        query.wSize = sizeof query;
+        query.dwStartTime = start;
+        query.dwEndTime = end;
+        for (uint32_t location = 1; location <= g_options.locations; ++location) {
+            locations.push_back(location);
+        }
+        locations.push_back(0);
+        query.pdwLocationIds = locations.data();
+        query.pszObjectType = "Human";
+        feature = vectorText(seeder.identityBody(7));
+        query.pszFeature = feature.c_str();
+        if (withFace) {
+            face = vectorText(seeder.identityFace(7));
+            query.pszFaceFeature = face.c_str();
+        }
+    }
+};
+
+// The float32 scan or the compact one, for the searches that follow.
+void useCompactScan(bool compact)
+{
+    ::setenv("TAMSA_SCAN", compact ? "compact" : "float32", 1);
+}
+
+void runFeatureSearch(benchmark::State& state, const FeatureSearch& s)
 {
     void* database = openDatabase(g_storePath);
-    const tamsa::TamsaSeeder seeder(g_options);
-    Search s;
-    std::memset(&s.query, 0, sizeof s.query);
-    s.query.wSize = sizeof s.query;
-    s.query.dwEndTime = 0xFFFFFFFFu;
-    for (uint32_t location = 1; location <= g_options.locations; ++location) {
-        s.locations.push_back(location);
-    }
-    s.locations.push_back(0);
-    s.query.pdwLocationIds = s.locations.data();
-    s.query.pszObjectType = "Human";
-    auto text = [](const std::vector<float>& vector) {
-        std::string out = "[";
-        char buffer[32];
-        for (size_t i = 0; i < vector.size(); ++i) {
-            out += (i ? "," : "") +
-                   std::string(buffer, size_t(std::snprintf(buffer, sizeof buffer, "%.7g", vector[i])));
-        }
-        return out + "]";
-    };
-    s.feature = text(seeder.identityBody(7));
-    s.query.pszFeature = s.feature.c_str();
-    if (state.range(0) == 1) {
-        s.face = text(seeder.identityFace(7));
-        s.query.pszFaceFeature = s.face.c_str();
-    }
+    useCompactScan(state.range(1) == 1);
     int records = 0;
     for (auto _ : state) {
         records = runSearch(database, s.query, 1 << 30);
     }
     state.counters["records"] = records;
-    state.counters["people"] = double(bodyMaps().rows);
+    useCompactScan(true);
     Tamsa_ReleaseDatabase(&database);
+}
+
+void BM_FeatureSearchAllLocations(benchmark::State& state)
+{
+    runFeatureSearch(state, FeatureSearch(state.range(0) == 1, 0, 0xFFFFFFFFu));
+    state.counters["people"] = double(bodyMaps().rows);
+}
+
+// Re-identification (body and face) over the last hour of the seeded span, or over all of it.
+void BM_ReIdWindow(benchmark::State& state)
+{
+    const uint32_t end = g_options.firstTime + g_options.spanSeconds;
+    runFeatureSearch(state, FeatureSearch(true, state.range(0) ? end - 3600 : g_options.firstTime, end));
+}
+
+// The whole span once with the store's files evicted from the page cache (as after a restart
+// or when the store outgrew memory), before anything maps them; then warm. Milliseconds.
+void reportColdSearch()
+{
+    ::sync(); // dirty pages cannot be evicted
+    QDirIterator it(QString::fromStdString(g_storePath), QDir::Files, QDirIterator::Subdirectories);
+    while (it.hasNext()) {
+        const int fd = ::open(it.next().toLocal8Bit().constData(), O_RDONLY | O_CLOEXEC);
+        if (fd >= 0) {
+            ::posix_fadvise(fd, 0, 0, POSIX_FADV_DONTNEED);
+            ::close(fd);
+        }
+    }
+    const FeatureSearch s(true, g_options.firstTime, g_options.firstTime + g_options.spanSeconds);
+    void* database = openDatabase(g_storePath);
+    std::vector<double> took;
+    int records = 0;
+    for (int run = 0; run < 6; ++run) {
+        const auto begin = std::chrono::steady_clock::now();
+        records = runSearch(database, s.query, 1 << 30);
+        took.push_back(seconds(std::chrono::steady_clock::now() - begin) * 1e3);
+    }
+    Tamsa_ReleaseDatabase(&database);
+    std::sort(took.begin() + 1, took.end());
+    std::printf(
+        "re-identification over the whole span, every location: cold page cache %.0f ms, warm %.1f ms "
+        "(median of 5); %d records\n",
+        took[0], took[3], records);
+    reportMemory("after the first searches");
 }
 
 void BM_Ingest(benchmark::State& state)
@@ -377,25 +620,38 @@ int main(int argc, char** argv)
     if (!prepareStore()) {
         return 1;
     }
-    reportScanAgainstBandwidth();
+    const bool scale = envNumber("TAMSA_BENCH_SCALE", 0) != 0;
+    reportColdSearch();
+    if (!scale) {
+        reportScanAgainstBandwidth();
+    }
     benchmark::RegisterBenchmark("BM_AttributeQueryFirst201", BM_AttributeQueryFirst201)
         ->Unit(benchmark::kMillisecond)
         ->Repetitions(15)
         ->ReportAggregatesOnly(true);
+    // float32 and compact alternate, so that both see the same machine load.
     benchmark::RegisterBenchmark("BM_FeatureSearchAllLocations", BM_FeatureSearchAllLocations)
-        ->ArgName("withFace")
-        ->Arg(0)
-        ->Arg(1)
+        ->ArgNames({"withFace", "compact"})
+        ->ArgsProduct({{0, 1}, {0, 1}})
         ->Unit(benchmark::kMillisecond)
         ->Repetitions(7)
         ->ReportAggregatesOnly(true);
-    benchmark::RegisterBenchmark("BM_Ingest", BM_Ingest)
+    benchmark::RegisterBenchmark("BM_ReIdWindow", BM_ReIdWindow)
+        ->ArgNames({"lastHour", "compact"})
+        ->ArgsProduct({{1, 0}, {0, 1}})
         ->Unit(benchmark::kMillisecond)
-        ->Iterations(2)
-        ->Repetitions(5)
+        ->Repetitions(7)
         ->ReportAggregatesOnly(true);
+    if (!scale) {
+        benchmark::RegisterBenchmark("BM_Ingest", BM_Ingest)
+            ->Unit(benchmark::kMillisecond)
+            ->Iterations(2)
+            ->Repetitions(5)
+            ->ReportAggregatesOnly(true);
+    }
     benchmark::Initialize(&argc, argv);
     benchmark::RunSpecifiedBenchmarks();
     benchmark::Shutdown();
+    reportMemory("at the end");
     return 0;
 }

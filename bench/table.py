@@ -169,6 +169,8 @@ def main():
     parser.add_argument("--locations", required=True)
     parser.add_argument("--targets", default=os.path.join(os.path.dirname(os.path.abspath(__file__)),
                                                           "targets.txt"))
+    parser.add_argument("--only", action="append", default=[],
+                        help="run only this program (repeatable); default every bench_* program")
     parser.add_argument("--no-run", action="store_true",
                         help="print the table of the last run again from the results folder")
     parser.add_argument("args", nargs="*")
@@ -179,7 +181,8 @@ def main():
     results_dir = os.path.splitext(options.out)[0]
     os.makedirs(results_dir, exist_ok=True)
     programs = sorted(p for p in os.listdir(options.bin)
-                      if p.startswith("bench_") and os.access(os.path.join(options.bin, p), os.X_OK))
+                      if p.startswith("bench_") and os.access(os.path.join(options.bin, p), os.X_OK)
+                      and (not options.only or p in options.only))
     started = datetime.datetime.now(datetime.timezone.utc)
     results = {}
     for program in programs:
@@ -201,8 +204,8 @@ def main():
         "%s, commit %s, %d cores, load average %s before the run." % (
             started.strftime("%Y-%m-%d %H:%M UTC"), commit or "unknown", os.cpu_count() or 0,
             " ".join("%.1f" % v for v in os.getloadavg())),
-        "Seeded stores: %s objects over %s locations (the store targets are for 1,000,000 over 100, "
-        "so store figures at another size are not the targets' figures)." % (
+        "Seeded stores: %s objects over %s locations (the store targets are for the size their figure "
+        "names, so store figures at another size are not the targets' figures)." % (
             "{:,}".format(int(options.objects)), options.locations),
         "Ratio is measured / target: at most 1 is met for a \"<=\" target, at least 1 for \">=\".",
         "",

@@ -6,6 +6,7 @@
 #include <sqlite3.h>
 
 #include <algorithm>
+#include <cstdlib>
 #include <cstring>
 #include <thread>
 
@@ -37,6 +38,15 @@ const char* const kColumns =
 constexpr int64_t kScanChunkRows = 2048;
 // Below this many rows one thread scans (starting threads would cost more than it saves).
 constexpr int64_t kParallelScanRows = 32768;
+
+std::atomic<bool> g_compactScan{true};
+
+// TAMSA_SCAN=float32 turns the compact copy off, read at every scan (benchmarks compare both ways).
+bool compactScanWanted()
+{
+    const char* mode = std::getenv("TAMSA_SCAN");
+    return g_compactScan.load(std::memory_order_relaxed) && !(mode && std::strcmp(mode, "float32") == 0);
+}
 
 int progressHandler(void* search)
 {
@@ -294,6 +304,11 @@ float TamsaSearch::score(const std::vector<float>& query, float queryNorm2, cons
     return cosineFromParts(dot, queryNorm2, norm2);
 }
 
+void TamsaSearch::setCompactScan(bool enabled)
+{
+    g_compactScan.store(enabled, std::memory_order_relaxed);
+}
+
 int32_t TamsaSearch::runScan()
 {
     struct Task
@@ -306,6 +321,8 @@ int32_t TamsaSearch::runScan()
     };
     float queryNorm2[2] = {0, 0};
     const std::vector<float>* queries[2] = {&m_query.m_body, &m_query.m_face};
+    // Compact scores only rule rows out; whatever they cannot rule out is scored in float32 below.
+    std::vector<CompactQuery> compactQueries(2);
     std::vector<Task> tasks;
     int64_t totalRows = 0;
     for (int kind = 0; kind < 2; ++kind) {
@@ -315,31 +332,51 @@ int32_t TamsaSearch::runScan()
         }
         float dot = 0;
         dotNormScalar()(query.data(), query.data(), query.size(), &dot, &queryNorm2[kind]);
+        if (compactScanWanted()) {
+            encodeCompactQuery(query, kScoreThreshold, &compactQueries[size_t(kind)]);
+        }
         for (uint32_t location : m_query.m_locations) {
             std::shared_ptr<const TamsaFeatureMap> map = m_store->featureMap(location, FeatureKind(kind));
             if (!map) {
                 continue;
             }
             m_maps[{location, kind}] = map;
-            for (int64_t begin = 0; begin < map->rows(); begin += kScanChunkRows) {
-                tasks.push_back(
-                    {map, location, FeatureKind(kind), begin, std::min(map->rows(), begin + kScanChunkRows)});
+            // Runs of time blocks that can hold rows overlapping the window, cut into chunks.
+            const std::vector<TimeBlock>& blocks = map->timeBlocks();
+            for (size_t b = 0; b < blocks.size();) {
+                if (blocks[b].firstStart > m_query.m_endTime || blocks[b].lastEnd < m_query.m_startTime) {
+                    ++b;
+                    continue;
+                }
+                size_t last = b;
+                while (last + 1 < blocks.size() && blocks[last + 1].firstStart <= m_query.m_endTime &&
+                       blocks[last + 1].lastEnd >= m_query.m_startTime) {
+                    ++last;
+                }
+                const int64_t runEnd = std::min(map->rows(), int64_t(last + 1) * kTimeBlockRows);
+                for (int64_t begin = int64_t(b) * kTimeBlockRows; begin < runEnd; begin += kScanChunkRows) {
+                    tasks.push_back(
+                        {map, location, FeatureKind(kind), begin, std::min(runEnd, begin + kScanChunkRows)});
+                }
+                totalRows += runEnd - int64_t(b) * kTimeBlockRows;
+                b = last + 1;
             }
-            totalRows += map->rows();
         }
     }
 
     const DotNormFn kernel = dotNormBest();
+    const CompactFilterFn compactFilter = compactFilterBest();
     std::atomic<size_t> nextTask{0};
     auto work = [&](std::vector<RawHit>* hits) {
+        std::vector<uint32_t> kept(static_cast<size_t>(kScanChunkRows));
         for (size_t t = nextTask++; t < tasks.size() && !aborted(); t = nextTask++) {
             const Task& task = tasks[t];
             const std::vector<float>& query = *queries[int(task.kind)];
             const float qn2 = queryNorm2[int(task.kind)];
-            for (int64_t row = task.begin; row < task.end; ++row) {
+            auto scoreRow = [&](int64_t row) {
                 const FeatureRowInfo& info = task.map->info(row);
                 if (info.startTime > m_query.m_endTime || info.endTime < m_query.m_startTime) {
-                    continue;
+                    return;
                 }
                 float dot = 0;
                 float norm2 = 0;
@@ -348,6 +385,21 @@ int32_t TamsaSearch::runScan()
                 if (cosine >= kScoreThreshold) {
                     hits->push_back({info.objectRowId, task.location, int(task.kind), row, cosine});
                 }
+            };
+            // Rows with a compact copy are scored in float32 only when it cannot rule them out.
+            const CompactQuery& compactQuery = compactQueries[size_t(task.kind)];
+            const int64_t compactEnd = compactQuery.usable
+                                           ? std::max(task.begin, std::min(task.end, task.map->compactRows()))
+                                           : task.begin;
+            const size_t count = compactEnd > task.begin
+                                     ? compactFilter(compactQuery, &task.map->compact(task.begin),
+                                                     size_t(compactEnd - task.begin), kept.data())
+                                     : 0;
+            for (size_t k = 0; k < count; ++k) {
+                scoreRow(task.begin + int64_t(kept[k]));
+            }
+            for (int64_t row = compactEnd; row < task.end; ++row) {
+                scoreRow(row);
             }
         }
     };

@@ -2,7 +2,8 @@
 // One open enumeration. Plain searches stream rows from SQLite, one cursor per location merged by
 // start time; feature searches scan the locations' vector files once (on the first Next, so that
 // Abort can reach the scan), keep the objects scoring at least kScoreThreshold and hand them out
-// best first.
+// best first. A scan reads only the time blocks that can overlap the window, and the compact
+// copy of each row before (and mostly instead of) its float32 row.
 //
 // Thread use: next() on the thread that owns the database handle; abort() from any thread.
 
@@ -34,6 +35,10 @@ public:
     TamsaSearch& operator=(const TamsaSearch&) = delete;
 
     int32_t next(TTAMSA_OBJECTMETAINFO_RESULT* result);
+    // Whether feature scans may rule rows out by their compact copy (the default); off, every
+    // row is scored in float32 (so also with TAMSA_SCAN=float32 in the environment). The results
+    // are the same either way; benchmarks and tests compare the two.
+    static void setCompactScan(bool enabled);
     void abort() { m_aborted.store(true, std::memory_order_relaxed); }
     bool aborted() const { return m_aborted.load(std::memory_order_relaxed); }
 

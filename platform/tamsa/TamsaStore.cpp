@@ -233,6 +233,11 @@ sqlite3* TamsaStore::connect(int32_t* status) const
         }
     }
     sqlite3_busy_timeout(db, 30000);
+    // With a persistent log, SQLite empties it after the last connection's checkpoint only when a
+    // size limit is set; without one every later last close (each handle of the plug-in) copied
+    // the same frames into the database again, for milliseconds per handle. The limit itself only
+    // bounds what the log keeps between checkpoints.
+    exec(db, "PRAGMA journal_size_limit=67108864");
     exec(db, m_fullSync ? "PRAGMA synchronous=FULL" : "PRAGMA synchronous=NORMAL");
     exec(db, "PRAGMA temp_store=MEMORY");
     exec(db, "PRAGMA cache_size=-65536");
@@ -252,11 +257,18 @@ std::string TamsaStore::infoPath(uint32_t location, FeatureKind kind) const
            (kind == FeatureKind::Body ? ".body" : ".face") + ".rows";
 }
 
+std::string TamsaStore::compactPath(uint32_t location, FeatureKind kind) const
+{
+    return m_directory + "/features/L" + std::to_string(location) +
+           (kind == FeatureKind::Body ? ".body" : ".face") + ".q8";
+}
+
 TamsaFeatureFile* TamsaStore::writer(uint32_t location, FeatureKind kind)
 {
     std::unique_ptr<TamsaFeatureFile>& file = m_writers[{location, int(kind)}];
     if (!file) {
-        file.reset(new TamsaFeatureFile(vectorPath(location, kind), infoPath(location, kind)));
+        file.reset(new TamsaFeatureFile(vectorPath(location, kind), infoPath(location, kind),
+                                        compactPath(location, kind)));
     }
     return file.get();
 }
@@ -371,13 +383,18 @@ std::shared_ptr<const TamsaFeatureMap> TamsaStore::featureMap(uint32_t location,
 {
     const std::string vectors = vectorPath(location, kind);
     const std::string infos = infoPath(location, kind);
+    const std::string compact = compactPath(location, kind);
     std::lock_guard<std::mutex> lock(m_mapMutex);
     std::shared_ptr<const TamsaFeatureMap>& cached = m_maps[{location, int(kind)}];
+    // A view whose compact rows lag (a store from before them) is renewed once a writer has
+    // filled them in.
     if (cached && cached->rows() >= needRows &&
-        cached->rows() == TamsaFeatureMap::rowsOnDisk(vectors, infos)) {
+        cached->rows() == TamsaFeatureMap::rowsOnDisk(vectors, infos) &&
+        (cached->compactRows() == cached->rows() ||
+         cached->compactRows() == std::min(cached->rows(), TamsaFeatureMap::compactRowsOnDisk(compact)))) {
         return cached;
     }
-    cached = TamsaFeatureMap::map(vectors, infos, cached);
+    cached = TamsaFeatureMap::map(vectors, infos, compact, cached);
     return cached;
 }
 

@@ -5,7 +5,7 @@
 //
 // Files in the directory: tamsa.db (SQLite, WAL; its -wal and -shm files stay after the last
 // connection, so that the store can be read where it cannot be written),
-// features/L<location>.<body|face>.f32 and .rows (see TamsaFeatureFile), tamsa.lock.
+// features/L<location>.<body|face>.f32, .rows and .q8 (see TamsaFeatureFile), tamsa.lock.
 //
 // Durability: an ingest returns after its data is written to the files (WAL, synchronous NORMAL),
 // so it survives a crash or kill of the process; a device sync per ingest costs tens of
@@ -58,6 +58,7 @@ private:
     explicit TamsaStore(std::string directory);
     std::string vectorPath(uint32_t location, FeatureKind kind) const;
     std::string infoPath(uint32_t location, FeatureKind kind) const;
+    std::string compactPath(uint32_t location, FeatureKind kind) const;
     TamsaFeatureFile* writer(uint32_t location, FeatureKind kind); // REQUIRES: m_writeMutex held
 
     const std::string m_directory;

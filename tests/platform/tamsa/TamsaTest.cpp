@@ -8,6 +8,8 @@
 #include "Faults.h"
 #include "StoreFixture.h"
 #include "TamsaCosine.h"
+#include "TamsaSearch.h"
+#include "TamsaSeeder.h"
 
 #include <QJsonArray>
 #include <QJsonDocument>
@@ -153,8 +155,6 @@ TEST_F(TamsaMatchingTest, FeatureScoresThresholdAndOrder)
     EXPECT_EQ(scored(both[0].id, both[0].score, both[0].faceScore),
               scored(4, plainCosine(identity, body4), plainCosine(faceIdentity, face4)));
     EXPECT_GE(std::max(both[1].score, both[1].faceScore), std::max(both[2].score, both[2].faceScore));
-    options.start = 2000; // time still applies to feature searches
-    EXPECT_TRUE(search(options).empty());
 
     // The vector kernel in use and the plain loop agree, also on lengths that leave a tail.
     for (size_t n : {kDim, kDim - 5, size_t(3)}) {
@@ -488,6 +488,134 @@ TEST_F(TamsaStorageFaultTest, FullDirectoryRefusesIngestWithoutLosingAcknowledge
     void* after = openStore(store);
     EXPECT_GE(searchStore(after, QueryOptions()).size(), 28u);
     Tamsa_ReleaseDatabase(&after);
+}
+
+using TamsaCompactScanTest = StoreFixture;
+
+// A search's hits with their exact score bits, in order; compact copy in use or not.
+std::string exactHits(void* database, const QueryOptions& options, bool compact)
+{
+    tamsa::TamsaSearch::setCompactScan(compact);
+    std::string out;
+    for (const ResultCopy& r : searchStore(database, options)) {
+        out += QString::asprintf("%llu:%a:%a ", qulonglong(r.id), r.score, r.faceScore).toStdString();
+    }
+    return out;
+}
+
+// Rows whose float32 score lies within 1e-6 of the threshold on both sides, some with one element
+// far above the rest (coarse codes), and rows near it whose every rounding error leans away from
+// the query (the estimate falls short by almost the whole bound): the compact test never rules
+// out a row that reaches 0.5, and search results stay bit for bit those of the float32 scan, on
+// the seeded store too. A store made without compact copies searches the same, and its writer
+// rebuilds them byte for byte.
+TEST_F(TamsaCompactScanTest, CompactCopyNeverChangesFeatureResults)
+{
+    const std::vector<float> q = randomUnitVector(1);
+    std::vector<ObjectSpec> rows;
+    int near = 0, leaning = 0;
+    tamsa::CompactQuery query;
+    tamsa::encodeCompactQuery(q, 0.5f, &query);
+    for (uint32_t i = 0; i < 400; ++i) {
+        std::vector<float> y = randomUnitVector(100 + i), x(kDim);
+        y[i % kDim] += i % 6 == 0 ? 0.9f : 0.0f;
+        const double along = std::inner_product(y.begin(), y.end(), q.begin(), 0.0);
+        const double c = i % 2 ? 0.48 + 0.04 * i / 400 : 0.5 + (i % 4 ? 1e-6 : -1e-6) * (i % 50) / 50;
+        const double yNorm =
+            std::sqrt(std::inner_product(y.begin(), y.end(), y.begin(), 0.0) - along * along);
+        double largest = 0;
+        for (size_t k = 0; k < kDim; ++k) {
+            x[k] = float((c * q[k] + std::sqrt(1 - c * c) * (y[k] - along * q[k]) / yNorm) *
+                         (i % 8 < 2 ? 1e-3 : 7));
+            largest = std::max(largest, std::fabs(double(x[k])));
+        }
+        const float step = float(largest / 127.0);
+        for (size_t k = 0; k < kDim && i % 2; ++k) { // codes round towards a smaller dot product
+            x[k] = std::fabs(x[k]) < largest
+                       ? step * float(std::floor(x[k] / step) + (q[k] > 0 ? 0.49 : 0.51))
+                       : x[k];
+        }
+        float dot = 0, norm2 = 0, qn2 = 0, ignored = 0;
+        tamsa::dotNormBest()(q.data(), x.data(), kDim, &dot, &norm2);
+        tamsa::dotNormScalar()(q.data(), q.data(), kDim, &ignored, &qn2);
+        const float score = tamsa::cosineFromParts(dot, qn2, norm2);
+        tamsa::CompactRow row;
+        tamsa::encodeCompactRow(x.data(), &row);
+        const int32_t exact = tamsa::compactDotScalar()(query, row);
+        EXPECT_EQ(tamsa::compactDotBest()(query, row), exact) << tamsa::compactDotBestName();
+        EXPECT_TRUE(score < 0.5f || tamsa::compactMayReach(query, row, exact)) << "row " << i;
+        near += std::fabs(score - 0.5f) < 1e-5f;
+        leaning += score >= 0.5f && float(exact) * row.scaleOverNorm * query.scaleOverNorm < query.limit;
+        rows.push_back({1 + i, "Human", 1000, 1010, "{}", {}, x});
+    }
+    // The threshold is really tried from both sides, and some rows are kept by their own bound alone.
+    EXPECT_TRUE(near > 150 && leaning > 10) << near << " near 0.5, " << leaning << " kept by the bound";
+    ASSERT_EQ(put(4, rows), 400);
+    const tamsa::TamsaSeeder seeder({3000, 3});
+    ASSERT_EQ(seeder.seed(m_database).status, 0);
+
+    std::vector<QueryOptions> queries(4, at({1, 2, 3, 4}));
+    for (uint32_t i = 0; i < 4; ++i) { // the rows above, then seeded people by body and face
+        queries[i].feature = jsonArray(i ? seeder.identityBody(i) : q);
+        queries[i].faceFeature = i ? jsonArray(seeder.identityFace(i * 5)) : "";
+    }
+    std::vector<std::string> expected;
+    for (const QueryOptions& options : queries) {
+        expected.push_back(exactHits(m_database, options, false));
+        EXPECT_EQ(exactHits(m_database, options, true), expected.back());
+        EXPECT_GT(expected.back().size(), 100u);
+    }
+    const std::filesystem::path features = storagePath() + "/features", old = storagePath() + "Old/features";
+    std::filesystem::copy(storagePath(), storagePath() + "Old", std::filesystem::copy_options::recursive);
+    for (int n = 0; n < 8; ++n) { // as a store from before the compact copy
+        std::filesystem::remove(old / ("L" + std::to_string(1 + n / 2) + (n % 2 ? ".face.q8" : ".body.q8")));
+    }
+    void* database = openStore(storagePath() + "Old");
+    for (int pass = 0; pass < 2; ++pass) { // before and after its copies are rebuilt
+        for (size_t i = 0; i < queries.size(); ++i) {
+            EXPECT_EQ(exactHits(database, queries[i], true), expected[i]) << "pass " << pass;
+        }
+        EXPECT_EQ(Tamsa_PutObjectMetaInfo(database, 7, 4, answerJson(numberedObjects(90000, 3)).c_str()), 3);
+    }
+    Tamsa_ReleaseDatabase(&database);
+    std::ifstream original(features / "L4.body.q8"), rebuilt(old / "L4.body.q8");
+    const std::string want{std::istreambuf_iterator<char>(original), {}};
+    EXPECT_EQ(std::string(std::istreambuf_iterator<char>(rebuilt), {}).substr(0, want.size()), want);
+}
+
+// Thirty days of objects, some arriving hours late or staying for weeks: a search over one hour
+// finds exactly the objects that overlap it, as a scan of every row would.
+TEST_F(TamsaCompactScanTest, TimeWindowScanFindsLateAndLongObjects)
+{
+    const std::vector<float> q = randomUnitVector(1);
+    const uint32_t day = 86400, from = 1000 + 15 * day, to = from + 3600;
+    std::vector<ObjectSpec> objects;
+    for (uint32_t i = 0; i < 1500; ++i) {
+        const uint32_t start = 1000 + i * (30 * day / 1500);
+        objects.push_back({i + 1, "Human", start, start + 60, "{}", {}, i % 2 ? q : randomUnitVector(i)});
+    }
+    objects.push_back({5000, "Human", 1000, 1000 + 30 * day, "{}", {}, q});  // weeks long
+    objects.push_back({5001, "Human", from + 100, from + 200, "{}", {}, q}); // late
+    objects.push_back({5002, "Human", from - 500, from + 10, "{}", {}, q});  // late, starts before
+    Ids expected;
+    for (const ObjectSpec& o : objects) {
+        expected.insert(expected.end(), o.body == q && o.start <= to && o.end >= from, o.id);
+    }
+    ASSERT_EQ(put(1, objects), int32_t(objects.size()));
+    Q options = at({1}, "", 1); // q's seed
+    options.start = from, options.end = to;
+    Ids got = searchIds(options);
+    std::sort(got.begin(), got.end());
+    EXPECT_EQ(got, expected);
+}
+
+// The last handle to go empties the log: otherwise every later handle's close copied the same
+// frames into the database again.
+TEST_F(TamsaCompactScanTest, LastHandleLeavesAnEmptyLog)
+{
+    ASSERT_EQ(put(1, numberedObjects(1, 50)), 50);
+    Tamsa_ReleaseDatabase(&m_database);
+    EXPECT_EQ(std::filesystem::file_size(storagePath() + "/tamsa.db-wal"), 0u);
 }
 
 } // namespace

@@ -69,6 +69,10 @@ QVariantMap batch(const QString& name, const QVariantList& items)
 {
     return {{KEY_CASE_NAME, name}, {KEY_CASE_ITEM, items}};
 }
+QVariantMap single(const QString& name, const QVariantMap& item)
+{
+    return {{KEY_CASE_NAME, name}, {KEY_CASE_ITEM, item}};
+}
 const auto caseIdOf = [](const Reply& reply) { return reply.payload.toMap().value(KEY_CASE_ID).toInt(); };
 
 // The replies as one text: "count final code 'message' [payload]" of the last.
@@ -163,10 +167,7 @@ TEST(PluginDelvixSrvDispatch, RefusalsAnswerOnceAndFinal)
 
 TEST_F(PluginCasesTest, VaultFollowsTheServerPath)
 {
-    ASSERT_EQ(call(CMD_ADD_CASE_WITH_ITEM,
-                   QVariantMap{{KEY_CASE_NAME, "in db"}, {KEY_CASE_ITEM, item("c1", false)}})
-                  .code,
-              RC_SUCCESS);
+    ASSERT_EQ(call(CMD_ADD_CASE_WITH_ITEM, single("in db", item("c1", false))).code, RC_SUCCESS);
     vault("db3").addCase(QStringLiteral("in db3"), QStringLiteral("1"), QString());
     // Two changes in a row: the second path's vault is the one in use.
     m_serverInfo.setServerDatabasePath(path("db2"));
@@ -202,8 +203,9 @@ TEST_F(PluginCasesTest, BatchesBookmarkWhereTheNodeLivesAndDeletesTakeTheBookmar
                                         {&m_remoteBookmarks, "east/c2"},
                                         {static_cast<BookmarkPlugin*>(nullptr), "west/c2"}}) {
         failing ? failing->setAnswerMode(BookmarkPlugin::AnswerMode::Fail) : void();
-        const QVariantMap single{{KEY_CASE_NAME, node}, {KEY_CASE_ITEM, item(node, true)}};
-        EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, single)), answered(RC_FAILURE, 2)) << node;
+        EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, single(node, item(node, true)))),
+                  answered(RC_FAILURE, 2))
+            << node;
         failing ? failing->setAnswerMode(BookmarkPlugin::AnswerMode::Normal) : void();
     }
     EXPECT_EQ(itemCounts(), QList<int>({2, 2, 0, 0, 0}));
@@ -366,10 +368,8 @@ TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
     for (int t = 0; t < kThreads; ++t) {
         threads.emplace_back([&, t]() {
             for (int n = t * kCasesPerThread; n < (t + 1) * kCasesPerThread; ++n) {
-                m_plugin->Request(
-                    CMD_ADD_CASE_WITH_ITEM,
-                    QVariantMap{{KEY_CASE_NAME, QString::number(n)}, {KEY_CASE_ITEM, item("c", false)}},
-                    m_sender, recorders[n].callback());
+                m_plugin->Request(CMD_ADD_CASE_WITH_ITEM, single(QString::number(n), item("c", false)),
+                                  m_sender, recorders[n].callback());
                 ReplyRecorder list;
                 m_plugin->Request(CMD_GET_CASE_LIST, QVariant(), m_sender, list.callback());
             }

@@ -79,7 +79,6 @@ class RecordingHttpClient : public IBraskHTTPClient
 public:
     struct Call
     {
-        QString path;
         QString text;          // "user:password@host:port[ ssl] path"
         Completion completion; // empty once completed
     };
@@ -87,8 +86,8 @@ public:
              const QString& password, Completion completion, unsigned int, const QList<QString>&) override
     {
         const QString ssl = useSSL ? QStringLiteral(" ssl") : QString();
-        calls.append({path,
-                      QStringLiteral("%1:%2@%3:%4%5 %6").arg(user, password, host).arg(port).arg(ssl, path),
+        paths << path;
+        calls.append({QStringLiteral("%1:%2@%3:%4%5 %6").arg(user, password, host).arg(port).arg(ssl, path),
                       std::move(completion)});
         return true;
     }
@@ -99,14 +98,6 @@ public:
             completion(error, QByteArray(), body, false);
         }
     }
-    QStringList paths() const
-    {
-        QStringList result;
-        for (const Call& call : calls) {
-            result << call.path;
-        }
-        return result;
-    }
-
     QList<Call> calls;
+    QStringList paths; // of every call, in order
 };

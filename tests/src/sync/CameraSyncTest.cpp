@@ -291,7 +291,7 @@ TEST_F(CameraSynchronizerTest, PluginWiresTheDirectoryTheSynchronizerAndTheColle
     }).join();
     EXPECT_TRUE(client->calls.isEmpty());
     EXPECT_TRUE(waitFor([&] { return !client->calls.isEmpty(); }));
-    EXPECT_EQ(client->paths(), QStringList{"/VCA/Data/DB/ObjectMeta?StartTime=1000&EndTime=5000&Info=127"});
+    EXPECT_EQ(client->paths, QStringList{"/VCA/Data/DB/ObjectMeta?StartTime=1000&EndTime=5000&Info=127"});
     EXPECT_TRUE(replies.replies().empty());
 }
 
@@ -360,7 +360,7 @@ TEST_F(CameraProxyTest, ComposedPathsAndCredentials)
     };
     for (const auto& [extra, expected] : rows) {
         const QString path = send(QString::number(client->calls.size()), 100, 160, true, extra);
-        EXPECT_EQ(client->calls.last().text + u' ' + client->calls.last().path, expected + u' ' + path);
+        EXPECT_EQ(client->calls.last().text + u' ' + client->paths.last(), expected + u' ' + path);
     }
 }
 
@@ -373,14 +373,14 @@ TEST_F(CameraProxyTest, OneRequestInFlightPerCameraCoveredWindowsDroppedFailureE
     send("a", 90, 150);        // ends before the last queued window: dropped
     send("a", 100, 160);       // equal end: queued
     send("a", 90, 150, false); // client-requested: never dropped
-    EXPECT_EQ(client->paths(), (QStringList{metaPath(40, 100), metaPath(0, 60)}));
+    EXPECT_EQ(client->paths, (QStringList{metaPath(40, 100), metaPath(0, 60)}));
 
     // Each answer sends the next queued window of that camera, in order.
     QSignalSpy answers(proxy.get(), &CameraProxy::receiveObjectMeta);
     for (int i : {0, 2, 3, 4}) {
         client->complete(i, QNetworkReply::NoError, "{}");
     }
-    EXPECT_EQ(client->paths().mid(2),
+    EXPECT_EQ(client->paths.mid(2),
               (QStringList{metaPath(100, 130), metaPath(130, 160), metaPath(100, 160), metaPath(90, 150)}));
     EXPECT_EQ(answers.size(), 4);
 
@@ -392,7 +392,7 @@ TEST_F(CameraProxyTest, OneRequestInFlightPerCameraCoveredWindowsDroppedFailureE
     EXPECT_EQ(client->calls.size(), 6);
     client->complete(1, QNetworkReply::NoError, "{}"); // b goes on
     send("a", 320, 380);
-    EXPECT_EQ(client->paths().mid(6), (QStringList{metaPath(60, 120), metaPath(320, 380)}));
+    EXPECT_EQ(client->paths.mid(6), (QStringList{metaPath(60, 120), metaPath(320, 380)}));
 }
 
 TEST_F(CameraProxyTest, AnswersCountObjectsAndUnusableAnswersFail)
@@ -437,7 +437,7 @@ TEST_F(CameraProxyTest, PairTokenExchangeBypassesTheQueue)
     proxy->sendPairTokenRequest(record);
     client->complete(3, QNetworkReply::ConnectionRefusedError, QByteArray());
     EXPECT_EQ(tokens, (QList<QList<QVariant>>{{"vault", QString::fromUtf8("tok\xc3\xa9n")}}));
-    EXPECT_EQ(client->paths().value(2), metaPath(60, 120));
+    EXPECT_EQ(client->paths.value(2), metaPath(60, 120));
     EXPECT_EQ(proxy->composePairTokenRequest({{"MultiChannel", 2}}).value("path").toString().left(12),
               "/VCA/c2/Secu");
 

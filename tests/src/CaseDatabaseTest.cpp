@@ -202,19 +202,17 @@ TEST_F(CaseDatabaseTest, WithoutPathOrWithStatementsRefusedTheFileStaysTrue)
                 "CREATE TRIGGER refuse%1 BEFORE %1 ON \"Case\" BEGIN SELECT RAISE(ABORT, 'no'); END")
                 .arg(event));
     }
-    EXPECT_EQ(vault.addCase("New", "2", "r"), 0);
-    EXPECT_FALSE(vault.updateCase(kept, {{"caseName", "Changed"}}) || vault.deleteCase(kept));
+    EXPECT_FALSE(vault.addCase("New", "2", "r") || vault.updateCase(kept, {{"caseName", "Changed"}}) ||
+                 vault.deleteCase(kept));
     EXPECT_EQ(vault.getAllCase(), casesBefore);
     EXPECT_EQ(fresh().getCaseItemIdSet(kept), QSet<int>{itemId});
 
     // Tables dropped behind its back: writes fail, reads come back empty, the map stays true.
     raw("DROP TABLE CaseItem");
-    EXPECT_EQ(vault.addCaseItem(kept, item(0, 1)), 0);
-    EXPECT_FALSE(vault.updateCaseItem(itemId, {}));
-    EXPECT_TRUE(vault.getCaseItemList(kept).isEmpty());
+    EXPECT_FALSE(vault.addCaseItem(kept, item(0, 1)) || vault.updateCaseItem(itemId, {}) ||
+                 !vault.getCaseItemList(kept).isEmpty());
     raw("DROP TABLE \"Case\"");
-    EXPECT_EQ(vault.addCase("New", "2", "r"), 0);
-    EXPECT_FALSE(vault.deleteCase(kept));
+    EXPECT_FALSE(vault.addCase("New", "2", "r") || vault.deleteCase(kept));
     EXPECT_EQ(vault.getAllCase(), casesBefore);
 }
 

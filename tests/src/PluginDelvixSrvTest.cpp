@@ -285,8 +285,7 @@ TEST_F(PluginCasesTest, BatchesAreAnsweredOnceWhateverTheBookmarkPluginDoes)
     m_plugin.reset();
     answering.join();
     QCoreApplication::processEvents();
-    EXPECT_EQ(waiting.finalCount(), 1);
-    EXPECT_TRUE(waiting.last().final);
+    EXPECT_TRUE(waiting.finalCount() == 1 && waiting.last().final);
     EXPECT_EQ(itemCounts(), QList<int>({2, 1, 1, 1, 0}));
 }
 

@@ -249,9 +249,9 @@ TEST_F(SearchTest, StopDuringReIdEndsEveryLocation)
     EXPECT_TRUE(waitFor([&] { return store->held == 3; }));
     worker->stop();
     search.join();
-    EXPECT_TRUE(held.endedOnce() && held.ids().empty());
-    EXPECT_EQ(QVariantList({int(store->aborts), int(store->closes), int(store->staleAborts)}),
-              QVariantList({3, 3, 0}));
+    EXPECT_EQ(QVariantList({held.endedOnce(), int(held.ids().size()), int(store->aborts), int(store->closes),
+                            int(store->staleAborts)}),
+              QVariantList({true, 0, 3, 3, 0}));
 }
 
 TEST_F(SearchTest, ScoresAndZones)
@@ -317,14 +317,12 @@ TEST_F(SearchTest, LateStopsAndStartsReachOnlyTheirOwnSearch)
     ASSERT_TRUE(waitFor([&] { return first.paused.load(); }));
     retriever->stop(kA);
     first.proceed = true;
-    EXPECT_TRUE(second.waitFinal());
-    EXPECT_EQ(second.ids().size(), 5u);
+    EXPECT_TRUE(second.waitFinal() && second.ids().size() == 5u);
     // A search queued just as the scheduler's thread runs out of work still runs.
     for (int round = 0; round < 200; ++round) {
         Hits hits;
         retriever->query(round % 2 ? kA : kB, crowd(1), hits.worker());
-        ASSERT_TRUE(hits.waitFinal(5000)) << "round " << round;
-        EXPECT_EQ(hits.ids().size(), 1u);
+        ASSERT_TRUE(hits.waitFinal(5000) && hits.ids().size() == 1u) << "round " << round;
     }
 }
 
@@ -356,8 +354,7 @@ TEST_F(SearchTest, SchedulerDestroyedFromItsOwnCallback)
     ASSERT_TRUE(waitFor([&] { return first.paused.load(); }));
     scheduler->query(kB, crowd(3), queued.worker());
     first.proceed = true;
-    EXPECT_TRUE(queued.waitFinal());
-    EXPECT_TRUE(queued.endedOnce() && queued.ids().empty());
+    EXPECT_TRUE(queued.waitFinal() && queued.endedOnce() && queued.ids().empty());
     EXPECT_EQ(QVariantList({int(first.ids().size()), int(store->firsts)}), QVariantList({3, 1}));
     EXPECT_TRUE(waitFor([&] { return owned.expired(); })); // the thread lets go of the worker
 }

@@ -111,8 +111,7 @@ TEST_F(CaseDatabaseTest, WritesAreWhatAFreshInstanceReadsBack)
                                               {"comment", "seen"},
                                               {"emapImageScale", 2.5},
                                               {"emapAngle", 90}}));
-    EXPECT_TRUE(vault.updateCaseItem(bareId, {}));
-    EXPECT_FALSE(vault.updateCaseItem(9999, {{"comment", "x"}}));
+    EXPECT_TRUE(vault.updateCaseItem(bareId, {}) && !vault.updateCaseItem(9999, {{"comment", "x"}}));
     EXPECT_EQ(json(fresh().getCaseItemInfoMap(fullId)),
               R"({"bookmarkId":"77","comment":"seen","emapAngle":90,"emapImageScale":2.5,)"
               R"("endTimestamp":2000,"faceImage":"face.jpg","id":1,)"
@@ -230,8 +229,7 @@ TEST_F(CaseDatabaseTest, ThreadsInstancesAndCopiesLoseNoWrite)
         EXPECT_TRUE(second.updateCase(shared, {{"caseName", "renamed"}}));
         EXPECT_EQ(original->getCaseInfoMap(shared).value("caseName"), "renamed");
         original.reset(); // the copies still use the connection
-        EXPECT_TRUE(copy.deleteCase(shared));
-        EXPECT_FALSE(second.containCase(shared));
+        EXPECT_TRUE(copy.deleteCase(shared) && !second.containCase(shared));
 
         // Two threads on one instance, one on a copy of it, one on another instance. Few rounds:
         // the two instances wait on each other's file lock, which takes long on a loaded machine.
@@ -246,8 +244,7 @@ TEST_F(CaseDatabaseTest, ThreadsInstancesAndCopiesLoseNoWrite)
                                           {{"comment", "c"}});
                     target.addCaseItem(caseId, item(0, 2000 + i, "", "o"));
                     target.updateCase(caseId, {{"caseName", "renamed"}});
-                    target.getCaseInfoMap(caseId);
-                    target.getCaseItemList(caseId);
+                    target.getCaseInfoMap(caseId), target.getCaseItemList(caseId); // reads among the writes
                 }
             });
         }

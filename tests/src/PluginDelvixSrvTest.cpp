@@ -113,17 +113,14 @@ protected:
     QString path(const char* folder) const { return m_dir.filePath(QLatin1String(folder)); }
 
     // Sends one request from this thread and waits for its final reply.
-    ReplyRecorder& send(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
+    ReplyRecorder& send(const QString& command, const QVariant& params)
     {
         ReplyRecorder& recorder = *m_recorders.emplace_back(std::make_unique<ReplyRecorder>());
-        (plugin ? plugin : m_plugin.get())->Request(command, params, m_sender, recorder.callback());
+        m_plugin->Request(command, params, m_sender, recorder.callback());
         recorder.waitFinal();
         return recorder;
     }
-    Reply call(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
-    {
-        return send(command, params, plugin).last();
-    }
+    Reply call(const QString& command, const QVariant& params) { return send(command, params).last(); }
     CaseDatabase vault(const char* folder = "db") const { return CaseDatabase(path(folder)); }
     // The item count of each case in the vault at `folder`, in case order.
     QList<int> itemCounts(const char* folder = "db") const
@@ -203,9 +200,8 @@ TEST_F(PluginCasesTest, BatchesBookmarkWhereTheNodeLivesAndDeletesTakeTheBookmar
                                         {&m_remoteBookmarks, "east/c2"},
                                         {static_cast<BookmarkPlugin*>(nullptr), "west/c2"}}) {
         failing ? failing->setAnswerMode(BookmarkPlugin::AnswerMode::Fail) : void();
-        EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, single(node, item(node, true)))),
-                  answered(RC_FAILURE, 2))
-            << node;
+        const QVariantMap one = single(node, item(node, true));
+        EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, one)), answered(RC_FAILURE, 2)) << node;
         failing ? failing->setAnswerMode(BookmarkPlugin::AnswerMode::Normal) : void();
     }
     EXPECT_EQ(itemCounts(), QList<int>({2, 2, 0, 0, 0}));

@@ -206,10 +206,8 @@ TEST_F(SearchTest, AtMost201HitsAndFailuresAndStopsEndWithTheFinalCallOnly)
     // A stop before the search begins ends it with no hits, and is then used up.
     store->failNextAfter = -1;
     const quint64 first = worker->searchGeneration();
-    EXPECT_TRUE(worker->stop(first));
-    EXPECT_EQ(find(crowd(50)), Ids{});
-    EXPECT_FALSE(worker->stop(first));
-    EXPECT_EQ(find(crowd(50)).size(), 50u);
+    EXPECT_TRUE(worker->stop(first) && find(crowd(50)).empty() && !worker->stop(first) &&
+                find(crowd(50)).size() == 50u);
 }
 
 TEST_F(SearchTest, ReIdSearchesEveryLocationOnItsOwn)
@@ -366,8 +364,7 @@ TEST_F(SearchTest, StopCommandsStopOnlyTheClientsSearch)
     plugin.setCameraInformationCollector(QSharedPointer<FakeCollector>::create());
     plugin.InitialPluginBase(nullptr);
     RequestSenderInfo a, b;
-    a.senderHandle = kA;
-    b.senderHandle = kB;
+    a.senderHandle = kA, b.senderHandle = kB;
     store->nextDelayMs = 10; // a search of some seconds unless stopped
     for (const QString& stop : {CMD_STOP_SEARCH, CMD_STOP_REID_SEARCH}) {
         ReplyRecorder running, stopReplies;

@@ -36,16 +36,10 @@ private:
 class FakeCollector : public ICameraInformationCollector
 {
 public:
-    struct Write
-    {
-        int group;
-        int location;
-        QString data;
-    };
     void writeData(int groupID, int locationID, const QString& data) override
     {
         QMutexLocker lock(&m_mutex);
-        m_writes.append({groupID, locationID, data});
+        m_writes << QStringLiteral("%1/%2 %3").arg(groupID).arg(locationID).arg(data);
     }
     void setDelvixSettings(const QVariantMap& settings) override
     {
@@ -53,7 +47,7 @@ public:
         m_settings = settings;
     }
     QString getCameraNodeID(const QString& location) override { return cameras.value(location); }
-    QList<Write> writes() const
+    QStringList writes() const // each as "group/location data"
     {
         QMutexLocker lock(&m_mutex);
         return m_writes;
@@ -68,7 +62,7 @@ public:
 
 private:
     mutable QMutex m_mutex;
-    QList<Write> m_writes;  // guarded by m_mutex
+    QStringList m_writes;   // guarded by m_mutex
     QVariantMap m_settings; // guarded by m_mutex
 };
 

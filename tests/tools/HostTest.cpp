@@ -110,8 +110,7 @@ public:
                      double wait = 60.0)
     {
         const ServeAnswerPtr answer = request(command, params, client, wait);
-        ServeConnection::wait(answer);
-        return *answer;
+        return ServeConnection::wait(answer), *answer;
     }
     // The transfer timeout ends every answer; this limit only guards against a stuck loop.
     static bool wait(const ServeAnswerPtr& answer)
@@ -543,9 +542,7 @@ TEST(HostDemo, RunsTheWholeSystemAndEveryStepFindsSomething)
           "re-identification" + found, "case workflow" + found, QString("bookmarks left: 0"),
           QString("demo complete"), QString("Human .+ (female|male), \\w+ top"),
           QString("serve --data .+\\n\\s+then open http://127\\.0\\.0\\.1:8765/")}) {
-        if (!QRegularExpression(line).match(out).hasMatch()) {
-            missing << line;
-        }
+        QRegularExpression(line).match(out).hasMatch() ? void() : void(missing << line);
     }
     EXPECT_TRUE(exitCode == 0 && missing.isEmpty()) << qPrintable(missing.join(", ") + " missing in\n" + out);
     EXPECT_TRUE(QFile::exists(data.filePath("demo/database/PluginDelvix/CaseVault.db")));

@@ -50,6 +50,7 @@ TEST(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
         }
     }
     ASSERT_GT(expected.size(), 5u);
+    ReplyRecorder replies; // outlives the plug-in, which answers a search it stops as it goes
     PluginDelvixSrv plugin;
     plugin.setCameraInformationCollector(directory);
     plugin.InitialPluginBase(nullptr);
@@ -62,7 +63,6 @@ TEST(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
         {KEY_END_TIMESTAMP, (qint64(options.firstTime) + options.spanSeconds + 3600) * 1000},
         {KEY_FEATURE, list(seeder.identityBody(identity))},
         {KEY_FACE_FEATURE, list(seeder.identityFace(identity))}};
-    ReplyRecorder replies;
     RequestSenderInfo sender;
     sender.senderHandle = &data;
     plugin.Request(CMD_START_REID_SEARCH, params, sender, replies.callback());

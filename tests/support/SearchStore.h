@@ -31,9 +31,9 @@ public:
     std::atomic<int> staleAborts{0}; // aborts of searches that were closed or never opened
     std::string counts() const
     {
-        return QString::asprintf("firsts %d opens %d closes %d releases %d aborts %d stale %d", int(firsts),
-                                 int(opens), int(closes), int(releases), int(aborts), int(staleAborts))
-            .toStdString();
+        return "firsts " + std::to_string(firsts) + " opens " + std::to_string(opens) + " closes " +
+               std::to_string(closes) + " releases " + std::to_string(releases) + " aborts " +
+               std::to_string(aborts) + " stale " + std::to_string(staleAborts);
     }
 
     long initDatabase(void** database) override

@@ -298,7 +298,7 @@ TEST_F(HttpCamerasTest, AnswersHoldTheWindowsObjectsTheSameEachTimeWithAThumbnai
     EXPECT_EQ(objects(fetch(client, window(from + 60, from + 120))).size(), inMiddleMinute);
 }
 
-TEST(PluginHost, LoadsThePluginDeliversRequestsOnRequestThreadsConnectsSignalsAndRelays)
+TEST(PluginHost, RefusesAMissingModuleRunsRequestsOnRequestThreadsConnectsSignalsAndRelays)
 {
     QTemporaryDir data;
     QFile config(data.filePath(u"host.json"_s));

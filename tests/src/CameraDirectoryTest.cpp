@@ -111,13 +111,6 @@ using NSNovirTunnelClient::ConfigServer;
 using NSNovirTunnelClient::LocationServer;
 using C = NOVIRSrvTunnelControl;
 
-QString readData(const char* name)
-{
-    QFile file(QStringLiteral(NOVIR_TEST_DATA "/") + QLatin1String(name));
-    EXPECT_TRUE(file.open(QIODevice::ReadOnly)) << name;
-    return QString::fromUtf8(file.readAll());
-}
-
 class TunnelControlTest : public ::testing::Test
 {
 protected:
@@ -150,12 +143,15 @@ protected:
         QObject::connect(control.get(), signal, control.get(),
                          [=](std::decay_t<A>... args) { events << (name + ... + (u' ' + text(args))); });
     }
-    // The map of the update signal after connecting `server` and answering its first request.
-    QVariantMap announced(NSNovirTunnelClient::ServerType server, const QString& answer)
+    // The map of the update signal after connecting `server` and answering its first request with
+    // the data file `name`.
+    QVariantMap announced(NSNovirTunnelClient::ServerType server, const char* name)
     {
+        QFile file(QStringLiteral(NOVIR_TEST_DATA "/") + QLatin1String(name));
+        EXPECT_TRUE(file.open(QIODevice::ReadOnly)) << name;
         client.connectServer(server);
         client.answer(client.lastRequest(server == ConfigServer ? u"GetNodeInfo"_s : u"QryLocs"_s), true,
-                      u"0"_s, answer);
+                      u"0"_s, QString::fromUtf8(file.readAll()));
         return QJsonDocument::fromJson(take().last().section(u' ', 1).toUtf8()).object().toVariantMap();
     }
     QStringList take() { return std::exchange(events, {}); }
@@ -349,8 +345,8 @@ TEST_F(TunnelControlTest, EachConnectionStartsItsWork)
                            u"sent GetNodeInfo <GetNodeInfo><Node>__allcams__</Node></GetNodeInfo>"_s,
                            u"sent SubCamStatus <SubCamStatus><SID>a&lt;b&gt;&amp;c</SID></SubCamStatus>"_s,
                            u"sent QryLocs <QryLocs><LiveOnly>false</LiveOnly></QryLocs>"_s}));
-    EXPECT_EQ(client.requests.at(3).serverId, u"a<b>&c"_s);
-    EXPECT_EQ(client.requests.at(4).type, LocationServer);
+    EXPECT_TRUE(client.requests.at(3).serverId == u"a<b>&c"_s &&
+                client.requests.at(4).type == LocationServer);
 }
 
 TEST_F(TunnelControlTest, ParsersKeepRecordingCamerasWithTheirConnectionRulesAndEveryLocationList)
@@ -366,7 +362,7 @@ TEST_F(TunnelControlTest, ParsersKeepRecordingCamerasWithTheirConnectionRulesAnd
         }
         return result.join(u' ').toStdString();
     };
-    const QVariantMap cameras = announced(ConfigServer, readData("nodeinfo_edge_cases.xml"));
+    const QVariantMap cameras = announced(ConfigServer, "nodeinfo_edge_cases.xml");
     EXPECT_EQ(
         cameras.keys().join(u' '),
         u"Dup HostileChannel Multi0 Multi3 MultiNoChannel Plain SingleChannel Sparse SslNoPort SslWithPort"_s);
@@ -382,7 +378,7 @@ TEST_F(TunnelControlTest, ParsersKeepRecordingCamerasWithTheirConnectionRulesAnd
     EXPECT_EQ(valuesFor(cameras, expected), expected.toStdString());
     EXPECT_EQ(cameras.value(u"Plain"_s).toMap().size(), 7);
 
-    const QVariantMap locations = announced(LocationServer, readData("locations_two_lists.xml"));
+    const QVariantMap locations = announced(LocationServer, "locations_two_lists.xml");
     EXPECT_EQ(locations.keys(), (QStringList{QString(), u"CamA"_s, u"CamB"_s, u"CamC"_s, u"Repeated"_s}));
     const QString located = u"CamA.Location=Loc1 CamA.GroupID=1 CamA.IsRecording=true CamC.IsRecording=false "
                             ".Location=Loc4 Repeated.Location=Loc9"_s;
@@ -415,7 +411,7 @@ TEST_F(TunnelControlTest, AnswersInPartsAndFailedAnswers)
     EXPECT_EQ(got, (QStringList{u"cameras A,B"_s, u"cameras A,B"_s, u"cameras A,B,C"_s, u"locs B"_s}));
 }
 
-TEST_F(TunnelControlTest, BroadcastsAndStatusEvents)
+TEST_F(TunnelControlTest, BroadcastsStatusEventsAndLateCallbacksAfterDestruction)
 {
     client.connectServer(ConfigServer);
     take();
@@ -447,11 +443,8 @@ TEST_F(TunnelControlTest, BroadcastsAndStatusEvents)
         }
         EXPECT_EQ(take(), f[3].split(u'+', Qt::SkipEmptyParts)) << qPrintable(row);
     }
-}
 
-TEST_F(TunnelControlTest, LateCallbacksAfterDestructionFindTheGuard)
-{
-    client.connectServer(ConfigServer);
+    // Late callbacks after the control is gone find its guard.
     client.connectServer(LocationServer);
     int context = 0;
     control->sendRequest(&client.account, u"Custom"_s, QString(), QString(), &context, ConfigServer);

@@ -6,7 +6,6 @@
 
 #include <QDateTime>
 #include <QDir>
-#include <QFileInfo>
 #include <QJsonDocument>
 #include <QSqlDatabase>
 #include <QSqlQuery>
@@ -112,8 +111,7 @@ TEST_F(CaseDatabaseTest, WritesAreWhatAFreshInstanceReadsBack)
                                               {"comment", "seen"},
                                               {"emapImageScale", 2.5},
                                               {"emapAngle", 90}}));
-    EXPECT_TRUE(vault.updateCaseItem(bareId, {}));
-    EXPECT_FALSE(vault.updateCaseItem(9999, {{"comment", "x"}}));
+    EXPECT_TRUE(vault.updateCaseItem(bareId, {}) && !vault.updateCaseItem(9999, {{"comment", "x"}}));
     EXPECT_EQ(json(fresh().getCaseItemInfoMap(fullId)),
               R"({"bookmarkId":"77","comment":"seen","emapAngle":90,"emapImageScale":2.5,)"
               R"("endTimestamp":2000,"faceImage":"face.jpg","id":1,)"
@@ -203,19 +201,17 @@ TEST_F(CaseDatabaseTest, WithoutPathOrWithStatementsRefusedTheFileStaysTrue)
                 "CREATE TRIGGER refuse%1 BEFORE %1 ON \"Case\" BEGIN SELECT RAISE(ABORT, 'no'); END")
                 .arg(event));
     }
-    EXPECT_EQ(vault.addCase("New", "2", "r"), 0);
-    EXPECT_FALSE(vault.updateCase(kept, {{"caseName", "Changed"}}) || vault.deleteCase(kept));
+    EXPECT_FALSE(vault.addCase("New", "2", "r") || vault.updateCase(kept, {{"caseName", "Changed"}}) ||
+                 vault.deleteCase(kept));
     EXPECT_EQ(vault.getAllCase(), casesBefore);
     EXPECT_EQ(fresh().getCaseItemIdSet(kept), QSet<int>{itemId});
 
     // Tables dropped behind its back: writes fail, reads come back empty, the map stays true.
     raw("DROP TABLE CaseItem");
-    EXPECT_EQ(vault.addCaseItem(kept, item(0, 1)), 0);
-    EXPECT_FALSE(vault.updateCaseItem(itemId, {}));
-    EXPECT_TRUE(vault.getCaseItemList(kept).isEmpty());
+    EXPECT_FALSE(vault.addCaseItem(kept, item(0, 1)) || vault.updateCaseItem(itemId, {}) ||
+                 !vault.getCaseItemList(kept).isEmpty());
     raw("DROP TABLE \"Case\"");
-    EXPECT_EQ(vault.addCase("New", "2", "r"), 0);
-    EXPECT_FALSE(vault.deleteCase(kept));
+    EXPECT_FALSE(vault.addCase("New", "2", "r") || vault.deleteCase(kept));
     EXPECT_EQ(vault.getAllCase(), casesBefore);
 }
 
@@ -233,8 +229,7 @@ TEST_F(CaseDatabaseTest, ThreadsInstancesAndCopiesLoseNoWrite)
         EXPECT_TRUE(second.updateCase(shared, {{"caseName", "renamed"}}));
         EXPECT_EQ(original->getCaseInfoMap(shared).value("caseName"), "renamed");
         original.reset(); // the copies still use the connection
-        EXPECT_TRUE(copy.deleteCase(shared));
-        EXPECT_FALSE(second.containCase(shared));
+        EXPECT_TRUE(copy.deleteCase(shared) && !second.containCase(shared));
 
         // Two threads on one instance, one on a copy of it, one on another instance. Few rounds:
         // the two instances wait on each other's file lock, which takes long on a loaded machine.
@@ -249,8 +244,7 @@ TEST_F(CaseDatabaseTest, ThreadsInstancesAndCopiesLoseNoWrite)
                                           {{"comment", "c"}});
                     target.addCaseItem(caseId, item(0, 2000 + i, "", "o"));
                     target.updateCase(caseId, {{"caseName", "renamed"}});
-                    target.getCaseInfoMap(caseId);
-                    target.getCaseItemList(caseId);
+                    target.getCaseInfoMap(caseId), target.getCaseItemList(caseId); // reads among the writes
                 }
             });
         }

@@ -69,6 +69,10 @@ QVariantMap batch(const QString& name, const QVariantList& items)
 {
     return {{KEY_CASE_NAME, name}, {KEY_CASE_ITEM, items}};
 }
+QVariantMap single(const QString& name, const QVariantMap& item)
+{
+    return {{KEY_CASE_NAME, name}, {KEY_CASE_ITEM, item}};
+}
 const auto caseIdOf = [](const Reply& reply) { return reply.payload.toMap().value(KEY_CASE_ID).toInt(); };
 
 // The replies as one text: "count final code 'message' [payload]" of the last.
@@ -109,17 +113,14 @@ protected:
     QString path(const char* folder) const { return m_dir.filePath(QLatin1String(folder)); }
 
     // Sends one request from this thread and waits for its final reply.
-    ReplyRecorder& send(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
+    ReplyRecorder& send(const QString& command, const QVariant& params)
     {
         ReplyRecorder& recorder = *m_recorders.emplace_back(std::make_unique<ReplyRecorder>());
-        (plugin ? plugin : m_plugin.get())->Request(command, params, m_sender, recorder.callback());
+        m_plugin->Request(command, params, m_sender, recorder.callback());
         recorder.waitFinal();
         return recorder;
     }
-    Reply call(const QString& command, const QVariant& params, PluginDelvixSrv* plugin = nullptr)
-    {
-        return send(command, params, plugin).last();
-    }
+    Reply call(const QString& command, const QVariant& params) { return send(command, params).last(); }
     CaseDatabase vault(const char* folder = "db") const { return CaseDatabase(path(folder)); }
     // The item count of each case in the vault at `folder`, in case order.
     QList<int> itemCounts(const char* folder = "db") const
@@ -163,10 +164,7 @@ TEST(PluginDelvixSrvDispatch, RefusalsAnswerOnceAndFinal)
 
 TEST_F(PluginCasesTest, VaultFollowsTheServerPath)
 {
-    ASSERT_EQ(call(CMD_ADD_CASE_WITH_ITEM,
-                   QVariantMap{{KEY_CASE_NAME, "in db"}, {KEY_CASE_ITEM, item("c1", false)}})
-                  .code,
-              RC_SUCCESS);
+    ASSERT_EQ(call(CMD_ADD_CASE_WITH_ITEM, single("in db", item("c1", false))).code, RC_SUCCESS);
     vault("db3").addCase(QStringLiteral("in db3"), QStringLiteral("1"), QString());
     // Two changes in a row: the second path's vault is the one in use.
     m_serverInfo.setServerDatabasePath(path("db2"));
@@ -202,8 +200,8 @@ TEST_F(PluginCasesTest, BatchesBookmarkWhereTheNodeLivesAndDeletesTakeTheBookmar
                                         {&m_remoteBookmarks, "east/c2"},
                                         {static_cast<BookmarkPlugin*>(nullptr), "west/c2"}}) {
         failing ? failing->setAnswerMode(BookmarkPlugin::AnswerMode::Fail) : void();
-        const QVariantMap single{{KEY_CASE_NAME, node}, {KEY_CASE_ITEM, item(node, true)}};
-        EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, single)), answered(RC_FAILURE, 2)) << node;
+        const QVariantMap one = single(node, item(node, true));
+        EXPECT_EQ(summary(send(CMD_ADD_CASE_WITH_ITEM, one)), answered(RC_FAILURE, 2)) << node;
         failing ? failing->setAnswerMode(BookmarkPlugin::AnswerMode::Normal) : void();
     }
     EXPECT_EQ(itemCounts(), QList<int>({2, 2, 0, 0, 0}));
@@ -283,8 +281,7 @@ TEST_F(PluginCasesTest, BatchesAreAnsweredOnceWhateverTheBookmarkPluginDoes)
     m_plugin.reset();
     answering.join();
     QCoreApplication::processEvents();
-    EXPECT_EQ(waiting.finalCount(), 1);
-    EXPECT_TRUE(waiting.last().final);
+    EXPECT_TRUE(waiting.finalCount() == 1 && waiting.last().final);
     EXPECT_EQ(itemCounts(), QList<int>({2, 1, 1, 1, 0}));
 }
 
@@ -366,10 +363,8 @@ TEST_F(PluginCasesTest, ConcurrentCaseCommandsSurviveAPathChange)
     for (int t = 0; t < kThreads; ++t) {
         threads.emplace_back([&, t]() {
             for (int n = t * kCasesPerThread; n < (t + 1) * kCasesPerThread; ++n) {
-                m_plugin->Request(
-                    CMD_ADD_CASE_WITH_ITEM,
-                    QVariantMap{{KEY_CASE_NAME, QString::number(n)}, {KEY_CASE_ITEM, item("c", false)}},
-                    m_sender, recorders[n].callback());
+                m_plugin->Request(CMD_ADD_CASE_WITH_ITEM, single(QString::number(n), item("c", false)),
+                                  m_sender, recorders[n].callback());
                 ReplyRecorder list;
                 m_plugin->Request(CMD_GET_CASE_LIST, QVariant(), m_sender, list.callback());
             }

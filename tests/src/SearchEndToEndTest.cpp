@@ -17,99 +17,32 @@
 
 #include <set>
 
-namespace {
-
-int g_client = 0;
-QTemporaryDir* g_data = nullptr;
-tamsa::TamsaSeedOptions g_options{4000, 4, 11};
-QString g_seedFailure; // why the suite's store could not be seeded; empty when it was
-
-const auto list = [](const std::vector<float>& vector) { return QVariantList(vector.begin(), vector.end()); };
-
-// "location/ID/camera" of each hit.
-std::set<QString> sightings(const std::vector<QVariantMap>& hits)
+TEST(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
 {
-    std::set<QString> found;
-    for (const QVariantMap& hit : hits) {
-        found.insert(QStringList{hit.value(KEY_LOC_ID).toString(), hit.value(KEY_OBJECT_ID).toString(),
-                                 hit.value(KEY_NODE_ID).toString()}
-                         .join('/'));
-    }
-    return found;
-}
+    QTemporaryDir data;
+    const tamsa::TamsaSeedOptions options{4000, 4, 11};
+    QSettings::setPath(QSettings::NativeFormat, QSettings::SystemScope, data.filePath("config"));
+    QSettings settings(QSettings::NativeFormat, QSettings::SystemScope, "Quorvex, Inc.", "NOVIR");
+    settings.setValue("Software/WOW6432node/INSTALL_PATH", QDir::toNativeSeparators(data.path()));
+    settings.setValue("Software/INSTALL_PATH", "/nonexistent");
+    settings.sync();
+    void* database = nullptr;
+    Tamsa_InitDatabase(&database, TamsaWrapper::initRecord().constData(), 0);
+    ASSERT_EQ(Tamsa_SetStoragesDBPath(database, data.filePath("Server").toUtf8().constData()), 0);
+    const tamsa::TamsaSeeder seeder(options);
+    const tamsa::TamsaSeedReport report = seeder.seed(database);
+    Tamsa_ReleaseDatabase(&database);
+    ASSERT_TRUE(report.status == 0 && report.stored == options.objects)
+        << report.status << " " << report.stored;
 
-class SearchEndToEndTest : public ::testing::Test
-{
-protected:
-    // Seeds once for the suite. A failure here is kept and reported by every test's SetUp: a
-    // failed assertion in the suite's own set-up would only mark its tests skipped.
-    static void SetUpTestSuite()
-    {
-        g_data = new QTemporaryDir;
-        const QDir data(g_data->path());
-        QSettings::setPath(QSettings::NativeFormat, QSettings::SystemScope, data.filePath("config"));
-        QSettings settings(QSettings::NativeFormat, QSettings::SystemScope, "Quorvex, Inc.", "NOVIR");
-        settings.setValue("Software/WOW6432node/INSTALL_PATH", QDir::toNativeSeparators(data.path()));
-        settings.setValue("Software/INSTALL_PATH", "/nonexistent");
-        settings.sync();
-        void* database = nullptr;
-        Tamsa_InitDatabase(&database, TamsaWrapper::initRecord().constData(), 0);
-        const int pathStatus =
-            Tamsa_SetStoragesDBPath(database, data.filePath("Server").toUtf8().constData());
-        const tamsa::TamsaSeedReport report = tamsa::TamsaSeeder(g_options).seed(database);
-        Tamsa_ReleaseDatabase(&database);
-        if (pathStatus != 0 || report.status != 0 || report.stored != g_options.objects) {
-            g_seedFailure = QString("path %1, status %2, %3 stored")
-                                .arg(pathStatus)
-                                .arg(report.status)
-                                .arg(report.stored);
-        }
-    }
-    static void TearDownTestSuite() { delete g_data; }
-
-    void SetUp() override
-    {
-        ASSERT_TRUE(g_seedFailure.isEmpty()) << qPrintable(g_seedFailure);
-        // The camera directory is not what these tests are about: location n on camera-n.
-        auto directory = QSharedPointer<FakeCollector>::create();
-        for (uint32_t location = 1; location <= g_options.locations; ++location) {
-            directory->cameras.insert(QString("Loc%1").arg(location), QString("camera-%1").arg(location));
-        }
-        plugin.setCameraInformationCollector(directory);
-        plugin.InitialPluginBase(nullptr);
-    }
-
-    // The whole seeded span at `locations`, with the conditions of `params`.
-    std::vector<QVariantMap> run(const QString& command, const QStringList& locations,
-                                 QVariantMap params = {})
-    {
-        params.insert(KEY_LOC_ID_LIST, locations);
-        params.insert(KEY_START_TIMESTAMP, qint64(g_options.firstTime) * 1000);
-        params.insert(KEY_END_TIMESTAMP, (qint64(g_options.firstTime) + g_options.spanSeconds + 3600) * 1000);
-        ReplyRecorder replies;
-        RequestSenderInfo sender;
-        sender.senderHandle = &g_client;
-        plugin.Request(command, params, sender, replies.callback());
-        EXPECT_TRUE(replies.waitFinal(60000));
-        EXPECT_EQ(replies.last().code, RC_SUCCESS);
-        std::vector<QVariantMap> hits;
-        for (const QVariant& hit : replies.progress()) {
-            hits.push_back(hit.toMap());
-        }
-        return hits;
-    }
-
-    const tamsa::TamsaSeeder seeder{g_options};
-    const uint32_t identity = std::max(1u, seeder.identityOf(1, 0)); // a person seen at Loc1
-    PluginDelvixSrv plugin;
-};
-
-} // namespace
-
-TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
-{
-    std::set<QString> expected;
-    for (uint32_t location = 1; location <= g_options.locations; ++location) {
+    // The camera directory is not what this is about: location n on camera-n.
+    auto directory = QSharedPointer<FakeCollector>::create();
+    QStringList locations;
+    std::set<QString> expected; // "location/ID/camera" of every sighting of a person seen at Loc1
+    const uint32_t identity = std::max(1u, seeder.identityOf(1, 0));
+    for (uint32_t location = 1; location <= options.locations; ++location) {
+        locations << QString("Loc%1").arg(location);
+        directory->cameras.insert(locations.last(), QString("camera-%1").arg(location));
         for (uint64_t index = 0; index < seeder.objectsAt(location); ++index) {
             if (seeder.isPerson(location, index) && seeder.identityOf(location, index) == identity) {
                 expected.insert(QString("Loc%1/%2/camera-%1").arg(location).arg(index + 1));
@@ -117,9 +50,31 @@ TEST_F(SearchEndToEndTest, ReIdFindsEverySightingOfOnePersonAndNoOneElse)
         }
     }
     ASSERT_GT(expected.size(), 5u);
-    const std::vector<QVariantMap> hits = run(CMD_START_REID_SEARCH, {"Loc1", "Loc2", "Loc3", "Loc4"},
-                                              {{KEY_FEATURE, list(seeder.identityBody(identity))},
-                                               {KEY_FACE_FEATURE, list(seeder.identityFace(identity))}});
-    EXPECT_EQ(sightings(hits).size(), hits.size()); // no duplicates
-    EXPECT_EQ(sightings(hits), expected);
+    ReplyRecorder replies; // outlives the plug-in, which answers a search it stops as it goes
+    PluginDelvixSrv plugin;
+    plugin.setCameraInformationCollector(directory);
+    plugin.InitialPluginBase(nullptr);
+    const auto list = [](const std::vector<float>& vector) {
+        return QVariantList(vector.begin(), vector.end());
+    };
+    const QVariantMap params{
+        {KEY_LOC_ID_LIST, locations},
+        {KEY_START_TIMESTAMP, qint64(options.firstTime) * 1000},
+        {KEY_END_TIMESTAMP, (qint64(options.firstTime) + options.spanSeconds + 3600) * 1000},
+        {KEY_FEATURE, list(seeder.identityBody(identity))},
+        {KEY_FACE_FEATURE, list(seeder.identityFace(identity))}};
+    RequestSenderInfo sender;
+    sender.senderHandle = &data;
+    plugin.Request(CMD_START_REID_SEARCH, params, sender, replies.callback());
+    ASSERT_TRUE(replies.waitFinal(60000));
+    EXPECT_EQ(replies.last().code, RC_SUCCESS);
+    std::set<QString> found;
+    for (const QVariant& hit : replies.progress()) {
+        const QVariantMap map = hit.toMap();
+        found.insert(QStringList{map.value(KEY_LOC_ID).toString(), map.value(KEY_OBJECT_ID).toString(),
+                                 map.value(KEY_NODE_ID).toString()}
+                         .join('/'));
+    }
+    EXPECT_EQ(found.size(), replies.progress().size()); // no duplicates
+    EXPECT_EQ(found, expected);
 }

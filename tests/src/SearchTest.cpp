@@ -206,10 +206,8 @@ TEST_F(SearchTest, AtMost201HitsAndFailuresAndStopsEndWithTheFinalCallOnly)
     // A stop before the search begins ends it with no hits, and is then used up.
     store->failNextAfter = -1;
     const quint64 first = worker->searchGeneration();
-    EXPECT_TRUE(worker->stop(first));
-    EXPECT_EQ(find(crowd(50)), Ids{});
-    EXPECT_FALSE(worker->stop(first));
-    EXPECT_EQ(find(crowd(50)).size(), 50u);
+    EXPECT_TRUE(worker->stop(first) && find(crowd(50)).empty() && !worker->stop(first) &&
+                find(crowd(50)).size() == 50u);
 }
 
 TEST_F(SearchTest, ReIdSearchesEveryLocationOnItsOwn)
@@ -249,9 +247,9 @@ TEST_F(SearchTest, StopDuringReIdEndsEveryLocation)
     EXPECT_TRUE(waitFor([&] { return store->held == 3; }));
     worker->stop();
     search.join();
-    EXPECT_TRUE(held.endedOnce() && held.ids().empty());
-    EXPECT_EQ(QVariantList({int(store->aborts), int(store->closes), int(store->staleAborts)}),
-              QVariantList({3, 3, 0}));
+    EXPECT_EQ(QVariantList({held.endedOnce(), int(held.ids().size()), int(store->aborts), int(store->closes),
+                            int(store->staleAborts)}),
+              QVariantList({true, 0, 3, 3, 0}));
 }
 
 TEST_F(SearchTest, ScoresAndZones)
@@ -317,14 +315,12 @@ TEST_F(SearchTest, LateStopsAndStartsReachOnlyTheirOwnSearch)
     ASSERT_TRUE(waitFor([&] { return first.paused.load(); }));
     retriever->stop(kA);
     first.proceed = true;
-    EXPECT_TRUE(second.waitFinal());
-    EXPECT_EQ(second.ids().size(), 5u);
+    EXPECT_TRUE(second.waitFinal() && second.ids().size() == 5u);
     // A search queued just as the scheduler's thread runs out of work still runs.
     for (int round = 0; round < 200; ++round) {
         Hits hits;
         retriever->query(round % 2 ? kA : kB, crowd(1), hits.worker());
-        ASSERT_TRUE(hits.waitFinal(5000)) << "round " << round;
-        EXPECT_EQ(hits.ids().size(), 1u);
+        ASSERT_TRUE(hits.waitFinal(5000) && hits.ids().size() == 1u) << "round " << round;
     }
 }
 
@@ -356,8 +352,7 @@ TEST_F(SearchTest, SchedulerDestroyedFromItsOwnCallback)
     ASSERT_TRUE(waitFor([&] { return first.paused.load(); }));
     scheduler->query(kB, crowd(3), queued.worker());
     first.proceed = true;
-    EXPECT_TRUE(queued.waitFinal());
-    EXPECT_TRUE(queued.endedOnce() && queued.ids().empty());
+    EXPECT_TRUE(queued.waitFinal() && queued.endedOnce() && queued.ids().empty());
     EXPECT_EQ(QVariantList({int(first.ids().size()), int(store->firsts)}), QVariantList({3, 1}));
     EXPECT_TRUE(waitFor([&] { return owned.expired(); })); // the thread lets go of the worker
 }
@@ -369,8 +364,7 @@ TEST_F(SearchTest, StopCommandsStopOnlyTheClientsSearch)
     plugin.setCameraInformationCollector(QSharedPointer<FakeCollector>::create());
     plugin.InitialPluginBase(nullptr);
     RequestSenderInfo a, b;
-    a.senderHandle = kA;
-    b.senderHandle = kB;
+    a.senderHandle = kA, b.senderHandle = kB;
     store->nextDelayMs = 10; // a search of some seconds unless stopped
     for (const QString& stop : {CMD_STOP_SEARCH, CMD_STOP_REID_SEARCH}) {
         ReplyRecorder running, stopReplies;

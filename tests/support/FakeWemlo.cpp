@@ -21,11 +21,10 @@ thread_local FakeWemloLine t_pending;
 int g_context = 0;
 WemloLogObject g_object{};
 
-int registerOp(void*, int kind, const char* name, int* idOut)
+int registerOp(void*, int, const char* name, int* idOut)
 {
     std::lock_guard<std::mutex> lock(g_mutex);
     g_state.registeredModules.emplace_back(name ? name : "");
-    g_state.registerKinds.push_back(kind);
     *idOut = g_behaviour.nextModuleId++;
     return 0;
 }

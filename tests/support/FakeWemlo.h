@@ -17,7 +17,6 @@ struct FakeWemloLine
 struct FakeWemloState
 {
     std::vector<std::string> registeredModules; // in order of registration
-    std::vector<int> registerKinds;
     int checkCalls = 0;
     int writeCalls = 0;
     std::vector<FakeWemloLine> lines;

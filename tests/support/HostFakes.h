@@ -36,16 +36,10 @@ private:
 class FakeCollector : public ICameraInformationCollector
 {
 public:
-    struct Write
-    {
-        int group;
-        int location;
-        QString data;
-    };
     void writeData(int groupID, int locationID, const QString& data) override
     {
         QMutexLocker lock(&m_mutex);
-        m_writes.append({groupID, locationID, data});
+        m_writes << QStringLiteral("%1/%2 %3").arg(groupID).arg(locationID).arg(data);
     }
     void setDelvixSettings(const QVariantMap& settings) override
     {
@@ -53,7 +47,7 @@ public:
         m_settings = settings;
     }
     QString getCameraNodeID(const QString& location) override { return cameras.value(location); }
-    QList<Write> writes() const
+    QStringList writes() const // each as "group/location data"
     {
         QMutexLocker lock(&m_mutex);
         return m_writes;
@@ -68,7 +62,7 @@ public:
 
 private:
     mutable QMutex m_mutex;
-    QList<Write> m_writes;  // guarded by m_mutex
+    QStringList m_writes;   // guarded by m_mutex
     QVariantMap m_settings; // guarded by m_mutex
 };
 
@@ -79,7 +73,6 @@ class RecordingHttpClient : public IBraskHTTPClient
 public:
     struct Call
     {
-        QString path;
         QString text;          // "user:password@host:port[ ssl] path"
         Completion completion; // empty once completed
     };
@@ -87,8 +80,8 @@ public:
              const QString& password, Completion completion, unsigned int, const QList<QString>&) override
     {
         const QString ssl = useSSL ? QStringLiteral(" ssl") : QString();
-        calls.append({path,
-                      QStringLiteral("%1:%2@%3:%4%5 %6").arg(user, password, host).arg(port).arg(ssl, path),
+        paths << path;
+        calls.append({QStringLiteral("%1:%2@%3:%4%5 %6").arg(user, password, host).arg(port).arg(ssl, path),
                       std::move(completion)});
         return true;
     }
@@ -99,14 +92,6 @@ public:
             completion(error, QByteArray(), body, false);
         }
     }
-    QStringList paths() const
-    {
-        QStringList result;
-        for (const Call& call : calls) {
-            result << call.path;
-        }
-        return result;
-    }
-
     QList<Call> calls;
+    QStringList paths; // of every call, in order
 };

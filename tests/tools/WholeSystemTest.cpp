@@ -41,9 +41,7 @@ protected:
         ASSERT_TRUE(m_site.start(storageDir(), 600, &error)) << qPrintable(error);
         QObject::connect(&m_site.server(), &NovirConfigServer::metaInfoIngested, &m_context,
                          [this](int, int location, int objects) {
-                             if (objects > 0) {
-                                 m_storedLocations.insert(location);
-                             }
+                             objects > 0 ? void(m_storedLocations.insert(location)) : void();
                          });
         m_host = std::make_unique<PluginHost>(m_dir.filePath("data"));
         m_host->setNovirTunnelClient(&m_site.server());
@@ -96,8 +94,7 @@ TEST_F(WholeSystem, EveryLocationIsStoredFoundAndBookmarkedAndUnloadIsClean)
     EXPECT_EQ(m_storedLocations, expected);
 
     RequestSenderInfo client;
-    int clientId = 0;
-    client.senderHandle = &clientId;
+    client.senderHandle = &client; // any address tells this client apart
     const QVariantMap window{{"startTimestamp", (QDateTime::currentSecsSinceEpoch() - 600) * 1000},
                              {"endTimestamp", QDateTime::currentMSecsSinceEpoch()},
                              {"locIDList", m_site.recordingLocations()}};

@@ -298,9 +298,13 @@ TEST_F(HttpCamerasTest, AnswersHoldTheWindowsObjectsTheSameEachTimeWithAThumbnai
     EXPECT_EQ(objects(fetch(client, window(from + 60, from + 120))).size(), inMiddleMinute);
 }
 
-TEST(PluginHost, LoadsThePluginAndDeliversRequestsOnRequestThreads)
+TEST(PluginHost, RefusesAMissingModuleRunsRequestsOnRequestThreadsConnectsSignalsAndRelays)
 {
     QTemporaryDir data;
+    QFile config(data.filePath(u"host.json"_s));
+    ASSERT_TRUE(config.open(QIODevice::WriteOnly) && config.write(R"({"remoteServers": ["", "east"]})") > 0);
+    config.close();
+    std::atomic<int> answers{0}; // outlives the host, whose plug-ins answer on threads of their own
     PluginHost host(data.path());
     QString error;
     EXPECT_FALSE(host.load(data.filePath(u"no.so"_s), &error) || host.plugin());
@@ -326,17 +330,8 @@ TEST(PluginHost, LoadsThePluginAndDeliversRequestsOnRequestThreads)
     EXPECT_TRUE(threads.size() == 40 && !threads.contains(QThread::currentThread())); // all replies are in
     host.unload();
     EXPECT_EQ(host.plugin(), nullptr);
-}
 
-TEST(PluginHost, ManagerConnectsPluginSignalsAndTheRelayReachesRemoteServers)
-{
-    QTemporaryDir data;
-    QFile config(data.filePath(u"host.json"_s));
-    ASSERT_TRUE(config.open(QIODevice::WriteOnly) && config.write(R"({"remoteServers": ["", "east"]})") > 0);
-    config.close();
-    std::atomic<int> answers{0}; // outlives the host, whose plug-ins answer on threads of their own
-    PluginHost host(data.path());
-
+    // The manager connects the host's own plug-ins' signals; the relay reaches the servers in host.json.
     const QString serverInfo = u"3CE573D25E0F455B8F75EDDC573E2B64"_s,
                   bookmarks = u"2F6394EE90434A7190D7511370AFAE17"_s;
     const char* signal = "2serverDatabasePathChanged(const QString &)";
@@ -400,7 +395,7 @@ TEST(BookmarkPlugin, ChangesSurviveARestartATornLineAndTheOlderForm)
     EXPECT_EQ(ids(), u"old"_s);
 }
 
-TEST(NovirSite, SiteFileIsReadAndABadOneLeavesTheSiteAlone)
+TEST(NovirSite, SiteFilesAreReadBadOnesLeaveTheSiteAloneAndTheirWordsDriveTheCameras)
 {
     NovirSite site;
     QString error;
@@ -410,7 +405,7 @@ TEST(NovirSite, SiteFileIsReadAndABadOneLeavesTheSiteAlone)
         "online":false}]})",
         &site, &error))
         << qPrintable(error);
-    const NovirCamera& a = site.cameras.value(0);
+    const NovirCamera a = site.cameras.value(0);
     EXPECT_EQ(std::tuple(site.cameras.size(), site.serverId, site.partSize, a.port, a.useSsl, a.httpsPort,
                          a.password, a.protectCap, a.channelCount, a.channel, a.location, a.groupId, a.live,
                          a.online),
@@ -427,14 +422,9 @@ TEST(NovirSite, SiteFileIsReadAndABadOneLeavesTheSiteAlone)
     EXPECT_EQ(valuesAt(NovirSite::nodeInfoXml({odd}), u"NodeInfo/Cameras/Cam/Name"_s) +
                   valuesAt(NovirSite::locationsXml({odd}), u"LocRecs/LocList/Loc/Alias"_s),
               (QStringList{odd.name, odd.name}));
-}
 
-// A site's own words replace the built-in ones attribute by attribute, and its cameras then make
-// only codes those words cover (and ages that are its words, quotes and all).
-TEST(NovirSite, VocabularyOfASiteFileDrivesItsCamerasAndItsWords)
-{
-    NovirSite site;
-    QString error;
+    // A site's own words replace the built-in ones attribute by attribute, and its cameras then make
+    // only codes those words cover (and ages that are its words, quotes and all).
     ASSERT_TRUE(NovirSite::fromJson(
         R"({"cameras":[],"vocabulary":{"Type":["car","lorry","tractor"],"Age":["kid","\"old\""]}})", &site,
         &error))

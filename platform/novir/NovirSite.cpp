@@ -308,3 +308,18 @@ QString NovirSite::indentedXml(const QString& xml)
     }
     return reader.hasError() ? xml : out;
 }
+
+QString NovirSite::exclusionReasons(const NovirCamera& camera)
+{
+    QStringList reasons;
+    if (!camera.recordCap) {
+        reasons << QStringLiteral("records no object metadata");
+    }
+    if (camera.location.isEmpty()) {
+        reasons << QStringLiteral("has no recording location");
+    }
+    if (!camera.online) {
+        reasons << QStringLiteral("offline");
+    }
+    return reasons.join(QStringLiteral(", "));
+}

@@ -53,6 +53,9 @@ public:
     // One location answer part; locations of cameras whose location is empty are left out.
     static QString locationsXml(const QList<NovirCamera>& cameras);
     static QString cameraStatusXml(const QList<NovirCamera>& cameras);
+    // Why a camera stays out of the plug-in's directory ("offline", ...), comma-separated; empty
+    // when nothing in its entry keeps it out.
+    static QString exclusionReasons(const NovirCamera& camera);
     // The same XML indented, every tag and every text on a line of its own, as servers that
     // pretty-print their answers write it (leaf texts then carry whitespace around them).
     static QString indentedXml(const QString& xml);

@@ -49,21 +49,6 @@ QVariantMap settledDirectory(PluginHost& host, NovirConfigServer& server, double
     return last;
 }
 
-QString why(const NovirCamera& camera)
-{
-    QStringList reasons;
-    if (!camera.recordCap) {
-        reasons << QStringLiteral("records no object metadata");
-    }
-    if (camera.location.isEmpty()) {
-        reasons << QStringLiteral("has no recording location");
-    }
-    if (!camera.online) {
-        reasons << QStringLiteral("offline");
-    }
-    return reasons.join(QStringLiteral(", "));
-}
-
 } // namespace
 
 int runCameras(QStringList args)
@@ -135,7 +120,7 @@ int runCameras(QStringList args)
     QStringList left;
     for (const NovirCamera& camera : site.cameras) {
         if (!directory.contains(camera.name)) {
-            left << QStringLiteral("  %1: %2").arg(camera.name, why(camera));
+            left << QStringLiteral("  %1: %2").arg(camera.name, NovirSite::exclusionReasons(camera));
         }
     }
     if (!left.isEmpty()) {

@@ -187,23 +187,12 @@ QByteArray HostHttpApi::camerasReport() const
         if (directory.contains(camera.name)) {
             continue;
         }
-        QStringList reasons;
-        if (!camera.recordCap) {
-            reasons << QStringLiteral("records no object metadata");
-        }
-        if (camera.location.isEmpty()) {
-            reasons << QStringLiteral("has no recording location");
-        }
-        if (!camera.online) {
-            reasons << QStringLiteral("offline");
-        }
-        if (reasons.isEmpty()) {
-            reasons << QStringLiteral("not announced yet");
-        }
-        left.append(QJsonObject{{"name", camera.name},
-                                {"location", camera.location},
-                                {"online", camera.online},
-                                {"reason", reasons.join(QStringLiteral(", "))}});
+        const QString reasons = NovirSite::exclusionReasons(camera);
+        left.append(
+            QJsonObject{{"name", camera.name},
+                        {"location", camera.location},
+                        {"online", camera.online},
+                        {"reason", reasons.isEmpty() ? QStringLiteral("not announced yet") : reasons}});
     }
     const QJsonObject report{
         {"cameras", cameras}, {"notInDirectory", left}, {"vocabulary", m_site.vocabulary.toJson()}};
